@@ -1,0 +1,48 @@
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+
+#include "platform/ThreadPool.h"
+
+namespace storix::linuxhost {
+
+/// Waits for file descriptors and calls back when they are ready, on a few threads of its own that
+/// share the work: whichever thread waits takes the next ready descriptor and serves it to the end,
+/// while another one waits in its place. So a request costs no change of thread, and a slow one
+/// delays nobody else: when every thread is busy, one more is started, up to a limit.
+///
+///  1. The handler of one watch never runs on two threads at once.
+///  2. After a watch is destroyed its handler does not start again; the destructor waits for one that
+///     is running, unless it runs inside that very handler.
+///  3. Tasks that a handler submits to the pool run after it, on the same thread (`LocalTasks`),
+///     unless the handler blocks.
+class IoLoop {
+ public:
+  /// Takes what epoll reports (EPOLLIN, EPOLLHUP, ...).
+  using Handler = std::function<void(std::uint32_t events)>;
+
+  class Watch {
+   public:
+    virtual ~Watch() = default;
+    /// Changes what is waited for; 0 pauses the watch. May be called from any thread.
+    virtual void setEvents(std::uint32_t events) = 0;
+  };
+
+  /// `pool` must outlive the loop.
+  explicit IoLoop(ThreadPool &pool);
+
+  /// Ends the threads. Watches must not be used afterwards, but may still be destroyed.
+  ~IoLoop();
+
+  /// Level-triggered: calls the handler as long as the descriptor is ready. The descriptor stays the
+  /// caller's and must live as long as the watch. Null when the kernel refuses.
+  std::unique_ptr<Watch> watch(int fd, std::uint32_t events, Handler handler);
+
+ private:
+  struct Implementation;
+  std::shared_ptr<Implementation> implementation_;
+};
+
+}  // namespace storix::linuxhost
