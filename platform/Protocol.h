@@ -6,6 +6,7 @@
 #include <set>
 #include <string>
 #include <string_view>
+#include <tuple>
 #include <utility>
 #include <vector>
 
@@ -40,6 +41,10 @@ struct ProtocolDescription {
   /// The row with that name (or method), or null.
   [[nodiscard]] const OperationDescription *operationNamed(std::string_view name) const;
 };
+
+/// Whether everything inside the list or dictionary, at any depth, is of one of those kinds. True for
+/// a value that holds no others.
+[[nodiscard]] bool holdsOnlyKinds(const Value &value, const std::set<ValueKind> &kinds);
 
 /// A protocol plus what was declared on it for one connection.
 class LinkInterface {
