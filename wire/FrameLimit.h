@@ -1,0 +1,37 @@
+#pragma once
+
+#include <cstddef>
+
+namespace storix::wire {
+
+inline constexpr std::size_t maximumMessageSize = std::size_t{1} << 20;
+
+/// Refuses messages beyond 1 MiB before they are read, since sd-bus itself would collect 128 MiB of one.
+///
+/// Between two messages it looks at the next header without taking it from the socket, and reads the
+/// message's length there; that also tells when there is nothing to read. Where it cannot know that a
+/// message begins here (sd-bus reads ahead during the login, and takes up what arrives of a header that
+/// is not all there), it counts what sd-bus takes from the socket until the next message is complete.
+/// Belongs to one connection and is guarded by its mutex.
+class FrameLimit {
+ public:
+  enum class Verdict { read, nothing, tooLarge };
+
+  /// Before each `sd_bus_process`. Where the answer is `nothing`, that call is only for what waits to
+  /// be written, or for a time-out.
+  Verdict beforeProcess(int fd);
+  /// After it. `drained` means that it found nothing more to do.
+  [[nodiscard]] Verdict afterProcess(int fd, bool loggedIn, bool gotMessage, bool drained);
+
+  /// True where sd-bus holds no bytes of a further message: whatever there is, is in the socket.
+  [[nodiscard]] bool atBoundary() const { return position_ == Position::boundary; }
+
+ private:
+  enum class Position { login, afterLogin, unknown, boundary, inMessage };
+
+  Position position_ = Position::login;
+  std::size_t pending_ = 0;
+  std::size_t counted_ = 0;
+};
+
+}  // namespace storix::wire
