@@ -23,6 +23,10 @@ class Executor {
   /// executor can have another thread work meanwhile. Use `BlockingScope`.
   virtual void willBlock() {}
   virtual void didUnblock() {}
+
+  /// False where nothing runs unless somebody calls for it; a `sync` that waits for earlier tasks then
+  /// runs them itself.
+  [[nodiscard]] virtual bool hasThreads() const { return true; }
 };
 
 /// Around every wait for another thread, or for the disk, inside a task.

@@ -15,8 +15,15 @@ namespace storix {
 /// the caller's thread.
 class ManualExecutor : public Executor {
  public:
+  ManualExecutor() = default;
+
+  /// Drops what has not run.
+  ~ManualExecutor() override;
+
   void execute(Task task) override;
   void executeAfter(std::chrono::nanoseconds delay, Task task) override;
+
+  [[nodiscard]] bool hasThreads() const override { return false; }
 
   /// Runs the task that has waited longest; false when there is none.
   bool runOne();

@@ -1,5 +1,7 @@
 #pragma once
 
+#include <cstddef>
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <string>
@@ -19,15 +21,15 @@ namespace storix {
 ///  3. `sync` and `syncBarrier` return after the task has run, and the task runs on the caller's
 ///     thread. Where nothing stands before it, that costs about an uncontended lock and no
 ///     allocation. Calling it from a task of the same queue is a programming error, but for a plain
-///     `sync` on a concurrent queue from a plain task, which only risks waiting behind a barrier.
+///     `sync` on a concurrent queue from a plain task while no barrier waits.
 ///  4. What a task wrote is visible to every task that the queue starts after it has ended, and to
 ///     the caller of `sync` after it returns; what the submitter wrote before is visible to the task.
 ///  5. While a queue is suspended no task of it starts, synchronous ones included; a task that has
 ///     started runs to its end. Suspensions are counted; a queue runs again when each has been
 ///     resumed. A task may suspend its own queue. More resumes than suspensions are a programming
 ///     error.
-///  6. A queue that is destroyed runs what was submitted to it first; a task may hold the last
-///     reference to its own queue.
+///  6. A queue whose last reference is gone runs what was submitted to it first, also if it is
+///     suspended then; a task may hold the last reference to its own queue.
 ///  7. A task that waits (in `sync`, for another queue's task) never keeps other tasks from running,
 ///     however many wait at the same time.
 ///
@@ -120,6 +122,9 @@ class ConcurrentQueue : public Queue {
   virtual void runSyncBarrier(TaskReference task) = 0;
 };
 
+/// Submits the task to the queue when the delay has passed. `executor` is the one of the queue.
+void runAfterDelay(Executor &executor, std::uint64_t nanoseconds, std::shared_ptr<Queue> queue, Task task);
+
 /// Runs operations in submission order, by default one at a time, so that what is added first (a
 /// registration, say) is over before what is added later (its withdrawal) starts.
 class OperationQueue {
@@ -138,6 +143,7 @@ class OperationQueue {
   /// Submits the operation and returns at once.
   virtual void addOperation(Task operation) = 0;
 
+  /// 0 counts as 1.
   virtual void setMaximumConcurrency(std::size_t maximum) = 0;
 
   /// The operation queue whose operation runs on this thread now; null outside of all.

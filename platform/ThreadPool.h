@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <cstddef>
 #include <memory>
 
@@ -12,8 +13,8 @@ namespace storix {
 class ThreadPool : public Executor {
  public:
   /// `concurrency` is the number of threads that work at the same time; 0 means one a processor,
-  /// and two at least.
-  explicit ThreadPool(std::size_t concurrency = 0);
+  /// and two at least. A thread that had no work for `idleTime` ends.
+  explicit ThreadPool(std::size_t concurrency = 0, std::chrono::nanoseconds idleTime = std::chrono::seconds(10));
 
   /// Runs what was given to `execute`, drops what waits for its delay, and ends all threads.
   ~ThreadPool() override;
