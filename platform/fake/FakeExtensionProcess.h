@@ -69,7 +69,6 @@ class FakeExtensionProcess {
 
  private:
   friend class FakeExtensions;
-  friend class FakeRemoteObject;
 
   struct BeginOutcome {
     std::optional<SXError> error;

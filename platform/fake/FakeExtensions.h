@@ -4,6 +4,7 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <set>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -84,12 +85,20 @@ class FakeExtensions {
   friend class FakeAuxiliaryConnection;
   friend class FakeRemoteObject;
   class Matching;
-  struct Request;
+  struct Request {
+    std::string extension;
+    std::shared_ptr<ExtensionContext> context;
+    std::vector<ConnectionErrorHandler> errorHandlers;
+  };
 
   void begin(const FakeExtension &extension, ExtensionRecord::BeginHandler completion);
   void cancel(const FakeExtension &extension, const RequestIdentifier &request);
   std::shared_ptr<ExtensionContext> context(const FakeExtension &extension, const RequestIdentifier &request);
-  std::shared_ptr<RemoteObject> proxy(const RequestIdentifier &request, ConnectionErrorHandler errorHandler);
+  std::shared_ptr<RemoteObject> proxy(const RequestIdentifier &request, const ProtocolDescription &protocol,
+                                      ConnectionErrorHandler errorHandler);
+  /// Sends a message; when the request has ended that is a failure of the connection.
+  void send(const RequestIdentifier &request, const OperationDescription &operation, const Arguments &arguments,
+            ReplyHandler reply, const ConnectionErrorHandler &errorHandler);
   void deliverTo(const std::shared_ptr<Matching> &matching, std::optional<SXError> error);
 
   FakeExecutor &executor_;
@@ -103,6 +112,8 @@ class FakeExtensions {
   std::map<std::string, ExtensionContextClass, std::less<>> contextClasses_;
   std::size_t requestCount_ = 0;
   std::map<std::string, Request> requests_;
+  std::set<std::string> withoutContext_;
+  std::set<std::string> withoutProxy_;
 };
 
 }  // namespace storix::fake

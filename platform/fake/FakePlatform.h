@@ -124,16 +124,8 @@ class FakePlatform final : public PlatformServices {
   void deliverNotification(const std::string &name);
 
   const Options options_;
-  FakeExecutor executor_;
-  Trace trace_;
-  FakeLog log_{trace_};
-  FakeFiles files_{trace_};
-  FakeSandbox sandbox_{trace_};
-  FakeConnections connections_{executor_, trace_};
-  FakeExtensions extensions_{executor_, trace_};
-  FakeFileCoordination fileCoordination_{trace_};
-  std::shared_ptr<ConcurrentQueue> globalQueue_;
 
+  // Guarded by `mutex_`. They stand before the executor, whose threads may use them until it is gone.
   mutable std::mutex mutex_;
   int lockState_ = deviceLockStateNoPasscode;
   bool unlockedSinceBoot_ = true;
@@ -143,6 +135,16 @@ class FakePlatform final : public PlatformServices {
   std::deque<std::string> notifications_;
   bool eventLoopEnds_ = false;
   std::condition_variable eventLoopHasWork_;
+
+  FakeExecutor executor_;
+  Trace trace_;
+  FakeLog log_{trace_};
+  FakeFiles files_{trace_};
+  FakeSandbox sandbox_{trace_};
+  FakeConnections connections_{executor_, trace_};
+  FakeExtensions extensions_{executor_, trace_};
+  FakeFileCoordination fileCoordination_{trace_};
+  std::shared_ptr<ConcurrentQueue> globalQueue_;
 };
 
 }  // namespace storix::fake
