@@ -15,10 +15,6 @@ bool DelayTimer::isLater(const Delayed &one, const Delayed &other) {
 }
 
 void DelayTimer::add(std::chrono::nanoseconds delay, Task task) {
-  if (delay <= std::chrono::nanoseconds::zero()) {
-    due_(std::move(task));
-    return;
-  }
   const Clock::time_point now = Clock::now();
   const Clock::time_point due = delay > Clock::time_point::max() - now ? Clock::time_point::max() : now + delay;
   const std::lock_guard lock(mutex_);

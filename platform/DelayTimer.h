@@ -16,7 +16,7 @@ namespace storix {
 /// the order in which they were added. Its thread is started with the first delayed task. Thread-safe.
 class DelayTimer {
  public:
-  /// `due` takes each task, on the timer's thread; a task without a delay at once, inside `add`.
+  /// `due` takes each task, on the timer's thread.
   explicit DelayTimer(std::function<void(Task)> due);
   ~DelayTimer();
   DelayTimer(const DelayTimer &) = delete;

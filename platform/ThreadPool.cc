@@ -189,7 +189,11 @@ void ThreadPool::execute(Task task) {
 }
 
 void ThreadPool::executeAfter(std::chrono::nanoseconds delay, Task task) {
-  implementation_->timer.add(delay, std::move(task));
+  if (delay <= std::chrono::nanoseconds::zero()) {
+    execute(std::move(task));
+  } else {
+    implementation_->timer.add(delay, std::move(task));
+  }
 }
 
 void ThreadPool::willBlock() {
