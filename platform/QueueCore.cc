@@ -210,8 +210,10 @@ void QueueCore::conclude(std::unique_lock<std::mutex> &lock) {
   Executor &executor = executor_;
   lock.unlock();
   for (std::size_t i = 0; i < consequences.drains; ++i) executor.execute(Drain(*this));
-  if (consequences.destroy) {
+  if (!consequences.destroy) return;
+  if (queue_) {
     delete queue_;
+  } else {
     delete operationQueue_;
   }
 }
