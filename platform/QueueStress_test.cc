@@ -22,13 +22,13 @@ constexpr int threadCount = 6;
 constexpr int rounds = 300;
 
 template <class Body>
-void onThreads(const Body &body) {
+void onThreads(const Body &body, int times = rounds) {
   std::vector<std::thread> threads;
   threads.reserve(threadCount);
   for (int i = 0; i < threadCount; ++i) {
-    threads.emplace_back([&body, i] {
+    threads.emplace_back([&body, i, times] {
       std::minstd_rand random(static_cast<unsigned>(i + 1));
-      for (int round = 0; round < rounds; ++round) body(i, random);
+      for (int round = 0; round < times; ++round) body(i, random);
     });
   }
   for (std::thread &thread : threads) thread.join();
@@ -111,32 +111,35 @@ TEST(QueueStress, ConcurrentQueueUnderEverythingAtOnce) {
 }
 
 TEST(QueueStress, TasksThatWaitForOtherQueuesTasks) {
+  constexpr int times = rounds / 3;  // each costs a thread
   ThreadPool pool(2);
   const auto global = ConcurrentQueue::create(pool, "global");
   // Waits go to queues further on alone, so that nobody waits in a ring.
   std::array<std::shared_ptr<SerialQueue>, 4> queues;
   for (auto &queue : queues) queue = SerialQueue::create(pool, "queue");
   std::array<long, 4> counts{};
-  TestCountdown done(static_cast<std::size_t>(threadCount) * rounds);
-  onThreads([&global, &queues, &counts, &done](int, std::minstd_rand &random) {
-    const std::size_t first = random() % 3;
-    const std::size_t second = first + 1 + random() % (3 - first);
-    global->async([&queues, &counts, &done, first, second] {
-      queues[first]->sync([&queues, &counts, first, second] {
-        ++counts[first];
-        queues[second]->sync([&counts, second] { ++counts[second]; });
-      });
-      done.arrive();
-    });
-    if (random() % 16 == 0) {
-      queues[second]->suspend();
-      global->async([&queues, second] { queues[second]->resume(); });
-    }
-  });
+  TestCountdown done(static_cast<std::size_t>(threadCount) * times);
+  onThreads(
+      [&global, &queues, &counts, &done](int, std::minstd_rand &random) {
+        const std::size_t first = random() % 3;
+        const std::size_t second = first + 1 + random() % (3 - first);
+        global->async([&queues, &counts, &done, first, second] {
+          queues[first]->sync([&queues, &counts, first, second] {
+            ++counts[first];
+            queues[second]->sync([&counts, second] { ++counts[second]; });
+          });
+          done.arrive();
+        });
+        if (random() % 16 == 0) {
+          queues[second]->suspend();
+          global->async([&queues, second] { queues[second]->resume(); });
+        }
+      },
+      times);
   EXPECT_TRUE(done.wait());
   long total = 0;
   for (std::size_t i = 0; i < queues.size(); ++i) queues[i]->sync([&total, &counts, i] { total += counts[i]; });
-  EXPECT_EQ(total, 2L * threadCount * rounds);
+  EXPECT_EQ(total, 2L * threadCount * times);
 }
 
 TEST(QueueStress, QueuesThatEndWhileTheirTasksWait) {
@@ -171,6 +174,7 @@ TEST(QueueStress, QueueSharedByThreadsOfWhichAnyIsTheLast) {
     auto queue = ConcurrentQueue::create(pool, "queue");
     TestCountdown meeting(4);
     std::vector<std::thread> threads;
+    threads.reserve(4);
     for (int i = 0; i < 4; ++i) {
       threads.emplace_back([own = queue, &meeting, i]() mutable {
         EXPECT_TRUE(meeting.arriveAndWait());

@@ -15,9 +15,12 @@
 namespace storix {
 
 struct ThreadPool::LocalTasks::State {
+  State(Implementation &ofPool, State *around) : pool(ofPool), outer(around) {}
+
   Implementation &pool;
-  std::deque<Task> tasks;
-  State *outer;
+  State *const outer;
+  std::vector<Task> tasks;
+  std::size_t next = 0;  // those before it have run
 };
 
 /// Whoever may work counts in `working`: a thread that is started or woken is counted by the one who
@@ -169,8 +172,7 @@ ThreadPool::LocalTasks::State *ThreadPool::Implementation::localTasks() const {
 
 void ThreadPool::Implementation::submitAllLocalTasks() {
   for (LocalTasks::State *state = innermost; state; state = state->outer) {
-    for (Task &task : state->tasks) state->pool.submit(std::move(task));
-    state->tasks.clear();
+    for (; state->next < state->tasks.size(); ++state->next) state->pool.submit(std::move(state->tasks[state->next]));
   }
 }
 
@@ -214,14 +216,13 @@ void ThreadPool::didUnblock() {
 }
 
 ThreadPool::LocalTasks::LocalTasks(ThreadPool &pool)
-    : state_(std::make_unique<State>(*pool.implementation_, std::deque<Task>(), Implementation::innermost)) {
+    : state_(std::make_unique<State>(*pool.implementation_, Implementation::innermost)) {
   Implementation::innermost = state_.get();
 }
 
 ThreadPool::LocalTasks::~LocalTasks() {
-  while (!state_->tasks.empty()) {
-    const Task task = std::move(state_->tasks.front());
-    state_->tasks.pop_front();
+  while (state_->next < state_->tasks.size()) {
+    const Task task = std::move(state_->tasks[state_->next++]);
     task();
   }
   Implementation::innermost = state_->outer;

@@ -262,6 +262,20 @@ TEST(ThreadPool, LaterDelayedTaskWithAnEarlierTimeDoesNotWaitForTheOthers) {
   EXPECT_TRUE(ran.wait());
 }
 
+TEST(ThreadPool, TasksWithEqualDelaysRunInTheOrderOfTheirCalls) {
+  ThreadPool pool(1);
+  std::vector<int> order;
+  TestCountdown ran(100);
+  for (int i = 0; i < 100; ++i) {
+    pool.executeAfter(milliseconds(1), [&order, &ran, i] {
+      order.push_back(i);
+      ran.arrive();
+    });
+  }
+  ASSERT_TRUE(ran.wait());
+  EXPECT_TRUE(std::is_sorted(order.begin(), order.end()));
+}
+
 TEST(ThreadPool, TaskWithoutDelayRunsAtOnce) {
   ThreadPool pool;
   TestCountdown ran(2);
