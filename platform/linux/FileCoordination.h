@@ -34,7 +34,7 @@ using ClaimHandler = std::function<void(ClaimOutcome)>;
 
 /// The claims of one platform connection. Made by `FileCoordination::claimsOf`, owned by the
 /// connection; destroying it ends all of them, the waiting ones included. Thread-safe; may outlive
-/// the service, which then refuses everything.
+/// the service, and then does nothing.
 class FileClaims {
  public:
   virtual ~FileClaims() = default;
@@ -66,7 +66,7 @@ class FileCoordination : public FileCoordinationService {
   /// Claims that one connection may hold or wait for.
   static constexpr std::size_t claimsPerConnection = 4096;
   /// Path components that the claims of all connections may have together.
-  static constexpr std::size_t componentsAltogether = std::size_t{1} << 20;
+  static constexpr std::size_t componentsAltogether = std::size_t{1} << 18;
 
   /// The process of the extension that is the provider with that identifier, while it has one: a child
   /// that has not been waited for, so that its number means no other process.
