@@ -96,6 +96,15 @@ std::string shortDescription(const SXError &error) {
 
 }  // namespace
 
+bool isUTF8(std::string_view text) {
+  while (!text.empty()) {
+    const std::size_t length = firstCharacter(text).length;
+    if (length == 0) return false;
+    text.remove_prefix(length);
+  }
+  return true;
+}
+
 std::string escapedForLog(std::string_view text) {
   std::string escaped;
   escaped.reserve(text.size());

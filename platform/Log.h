@@ -31,6 +31,9 @@ class LogSink {
 /// identifier or error text from outside can end a line or begin another.
 std::string escapedForLog(std::string_view text);
 
+/// Whether the text is well-formed UTF-8.
+[[nodiscard]] bool isUTF8(std::string_view text);
+
 std::string valueLogDescription(const Value &value);
 
 /// What "%@" prints for a value. Absent prints as "(null)". Unescaped.
@@ -67,7 +70,7 @@ template <class... Arguments>
 class LogFormat {
  public:
   template <class Text>
-    requires std::convertible_to<const Text &, std::string_view>
+  requires std::convertible_to<const Text &, std::string_view>
   consteval LogFormat(const Text &text) : text_(text) {
     std::size_t argument = 0;
     for (std::size_t i = 0; i < text_.size(); ++i) {

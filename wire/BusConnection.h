@@ -4,19 +4,25 @@
 #include <cstddef>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
+#include <variant>
 #include <vector>
 
 #include "platform/Executor.h"
 #include "platform/Extensions.h"
 #include "platform/Protocol.h"
 #include "platform/Result.h"
+#include "wire/SdBus.h"
 #include "wire/Signature.h"
 #include "wire/UniqueFd.h"
 
 namespace storix::wire {
+
+class Waiter;
+struct BusMethod;
 
 /// One peer-to-peer D-Bus connection over a connected socket, either end of it.
 ///
@@ -51,6 +57,8 @@ class BusConnection : public std::enable_shared_from_this<BusConnection> {
 
   using ClosedHandler = std::function<void(const SXError &)>;
 
+  struct Request;
+
   /// Answers one request of an interface that is described by hand: at most once, on any thread.
   /// Copies answer the same request.
   class Reply {
@@ -60,7 +68,6 @@ class BusConnection : public std::enable_shared_from_this<BusConnection> {
 
    private:
     friend class BusConnection;
-    struct Request;
     explicit Reply(std::shared_ptr<Request> request) : request_(std::move(request)) {}
     std::shared_ptr<Request> request_;
   };
@@ -118,7 +125,23 @@ class BusConnection : public std::enable_shared_from_this<BusConnection> {
  private:
   struct State;
   struct Remote;
-  explicit BusConnection(std::unique_ptr<State> state);
+  using Lock = std::unique_lock<std::mutex>;
+
+  explicit BusConnection(std::unique_ptr<State> state, int fd);
+
+  using Append = std::function<std::optional<MethodFailure>(sd_bus_message *message)>;
+  void sendCall(const InterfaceDescription &interface, std::size_t method, const Append &append,
+                std::unique_ptr<Waiter> waiter, bool expectsReply);
+
+  // These take the state's lock held and give it back held; handlers run between, without it.
+  bool step(Lock &lock);
+  void loggedIn(Lock &lock);
+  void dispatch(Lock &lock, OwnedMessage message);
+  void dispatchRequest(Lock &lock, OwnedMessage message);
+  void refuse(Lock &lock, OwnedMessage message, const MethodFailure &failure);
+  void handOver(Lock &lock, OwnedMessage message, BusMethod method, std::variant<Arguments, MethodValues> content);
+  void dispatchReply(Lock &lock, OwnedMessage message);
+  void end(Lock &lock, const SXError &reason, bool later);
 
   std::unique_ptr<State> state_;
   const int fd_;

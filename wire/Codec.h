@@ -29,6 +29,10 @@ inline constexpr std::string_view notSupported = "org.freedesktop.DBus.Error.Not
 inline constexpr std::string_view disconnected = "org.freedesktop.DBus.Error.Disconnected";
 }  // namespace busErrorName
 
+/// The text itself, or, where D-Bus would refuse it (it is not UTF-8, or holds a zero byte), the text with
+/// every byte of it that is not ASCII written as "\xNN".
+std::string busText(std::string text);
+
 /// One side of one row of a protocol: what a message must carry, or is filled with.
 struct MessageRow {
   const LinkInterface &interface;

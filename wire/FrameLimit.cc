@@ -64,31 +64,26 @@ FrameLimit::Verdict FrameLimit::beforeProcess(int fd) {
 }
 
 FrameLimit::Verdict FrameLimit::afterProcess(int fd, bool loggedIn, bool gotMessage, bool drained) {
-  switch (position_) {
-    case Position::login:
-      if (loggedIn) position_ = Position::afterLogin;
-      break;
-    case Position::boundary:
-      // Called to write; something may have come in meanwhile and have been taken up in part.
-      position_ = Position::unknown;
-      counted_ = 0;
-      break;
-    case Position::inMessage:
-      break;
-    case Position::afterLogin:
-    case Position::unknown:
-      counted_ += pending_;
-      if (counted_ > maximumMessageSize) {
-        const std::size_t left = gotMessage ? bytesInSocket(fd) : 0;
-        if (counted_ > maximumMessageSize + left) return Verdict::tooLarge;
-      }
-      if (position_ == Position::afterLogin && drained) position_ = Position::unknown;
-      break;
+  if (position_ == Position::login) {
+    if (!loggedIn) return Verdict::read;
+    position_ = Position::afterLogin;
+    counted_ = 0;
+    pending_ = 0;
+  }
+  const bool counting = position_ == Position::afterLogin || position_ == Position::unknown;
+  if (counting && (gotMessage || drained)) {
+    counted_ += pending_;
+    const std::size_t left = gotMessage && counted_ > maximumMessageSize ? bytesInSocket(fd) : 0;
+    if (counted_ > maximumMessageSize + left) return Verdict::tooLarge;
   }
   if (gotMessage) {
     counted_ = 0;
-    if (position_ != Position::login && position_ != Position::afterLogin) position_ = Position::boundary;
+    if (position_ != Position::afterLogin) position_ = Position::boundary;
+    return Verdict::read;
   }
+  // sd-bus may hold a part of a message now, or may have dropped or answered one by itself.
+  if (!counting) counted_ = 0;
+  if (drained || !counting) position_ = Position::unknown;
   return Verdict::read;
 }
 

@@ -13,7 +13,7 @@ namespace storix::wire {
 /// Owners of sd-bus objects. Their reference counts are not atomic: whoever copies out or destroys one
 /// holds the mutex of its connection.
 struct BusDeleter {
-  void operator()(sd_bus *bus) const { sd_bus_unref(bus); }
+  void operator()(sd_bus *bus) const { sd_bus_close_unref(bus); }
 };
 using OwnedBus = std::unique_ptr<sd_bus, BusDeleter>;
 

@@ -1,0 +1,226 @@
+#include "wire/BusConnection.h"
+
+#include <poll.h>
+#include <sys/socket.h>
+
+#include <cerrno>
+#include <cstdint>
+#include <utility>
+
+#include "platform/Log.h"
+#include "wire/BusConnectionState.h"
+
+namespace storix::wire {
+
+namespace {
+
+/// The identity that this process shows as a D-Bus server.
+sd_id128_t serverIdentity() {
+  static const sd_id128_t identity = [] {
+    sd_id128_t made{};
+    sd_id128_randomize(&made);
+    return made;
+  }();
+  return identity;
+}
+
+bool hasHungUp(int fd) {
+  pollfd waited{fd, 0, 0};
+  return poll(&waited, 1, 0) > 0;
+}
+
+}  // namespace
+
+Result<std::shared_ptr<BusConnection>> BusConnection::open(UniqueFd socket, Options options) {
+  sd_bus *raw = nullptr;
+  int result = sd_bus_new(&raw);
+  if (result < 0) return busError(result, "make a D-Bus connection");
+  OwnedBus bus(raw);
+  const int fd = socket.get();
+  result = sd_bus_set_fd(raw, fd, fd);
+  if (result < 0) return busError(result, "use the socket of " + options.peer);
+  (void)socket.release();
+  if (options.side == Side::server) result = sd_bus_set_server(raw, 1, serverIdentity());
+  if (result >= 0) result = sd_bus_negotiate_fds(raw, options.descriptors == Descriptors::passed ? 1 : 0);
+  if (result >= 0) result = sd_bus_start(raw);
+  if (result < 0) return busError(result, "begin the login of " + options.peer);
+
+  auto state = std::make_unique<State>();
+  state->options = std::move(options);
+  state->bus = std::move(bus);
+  return std::shared_ptr<BusConnection>(new BusConnection(std::move(state), fd));
+}
+
+BusConnection::BusConnection(std::unique_ptr<State> state, int fd) : state_(std::move(state)), fd_(fd) {}
+
+BusConnection::~BusConnection() { close(); }
+
+void BusConnection::setReadyHandler(std::function<void()> handler) {
+  const std::lock_guard lock(state_->mutex);
+  state_->readyHandler = std::move(handler);
+}
+
+void BusConnection::setClosedHandler(ClosedHandler handler) {
+  const std::lock_guard lock(state_->mutex);
+  state_->closedHandler = std::move(handler);
+}
+
+void BusConnection::setWantedChangedHandler(std::function<void()> handler) {
+  const std::lock_guard lock(state_->mutex);
+  state_->wantedChangedHandler = std::move(handler);
+}
+
+bool BusConnection::isOpen() const {
+  const std::lock_guard lock(state_->mutex);
+  return !state_->ended;
+}
+
+void BusConnection::close() {
+  Lock lock(state_->mutex);
+  end(lock, posixError(ECANCELED, "the connection to " + state_->options.peer + " was closed on this side"), true);
+}
+
+void BusConnection::releaseSocket() {
+  close();
+  const std::lock_guard lock(state_->mutex);
+  sd_bus_close(state_->bus.get());
+}
+
+BusConnection::Wanted BusConnection::wanted() {
+  const std::lock_guard lock(state_->mutex);
+  Wanted wanted;
+  if (state_->ended) return wanted;
+  const int events = sd_bus_get_events(state_->bus.get());
+  wanted.events = static_cast<short>(events > 0 ? events : 0);
+  if (state_->isFull()) {
+    wanted.events = static_cast<short>(wanted.events & ~POLLIN);
+  } else if (!state_->held.empty()) {
+    // A request is here already. The socket says at once that it may be written to.
+    wanted.events |= POLLOUT;
+  }
+  std::uint64_t microseconds = UINT64_MAX;
+  if (sd_bus_get_timeout(state_->bus.get(), &microseconds) >= 0 && microseconds != UINT64_MAX) {
+    wanted.deadline = std::chrono::steady_clock::time_point(std::chrono::microseconds(microseconds));
+  }
+  return wanted;
+}
+
+void BusConnection::process() {
+  // A handler may let go of the connection.
+  const std::shared_ptr<BusConnection> self = shared_from_this();
+  Lock lock(state_->mutex);
+  while (!state_->ended && step(lock)) {
+  }
+}
+
+/// One turn of `process`; false when there is nothing more to do for now.
+bool BusConnection::step(Lock &lock) {
+  State &state = *state_;
+  if (!state.held.empty() && !state.isFull()) {
+    OwnedMessage message = std::move(state.held.front());
+    state.held.pop_front();
+    dispatch(lock, std::move(message));
+    return true;
+  }
+  const bool writes = state.hasUnwritten();
+  if (state.isFull() && (!writes || state.held.size() >= maximumHeldRequests)) {
+    if (hasHungUp(fd_)) end(lock, posixError(ECONNRESET, "the peer closed the connection"), false);
+    return false;
+  }
+
+  FrameLimit::Verdict verdict = state.frames.beforeProcess(fd_);
+  if (verdict == FrameLimit::Verdict::nothing && !writes) return false;
+  OwnedMessage message;
+  int result = 0;
+  if (verdict != FrameLimit::Verdict::tooLarge) {
+    sd_bus_message *raw = nullptr;
+    result = sd_bus_process(state.bus.get(), &raw);
+    message.reset(raw);
+    const bool open = sd_bus_is_open(state.bus.get()) > 0;
+    if (result < 0 || !open) {
+      const int reason = result < 0 ? -result : ECONNRESET;
+      message.reset();
+      end(lock, posixError(reason, state.loggedIn ? "the peer closed or broke the connection" : "the login failed"),
+          false);
+      return false;
+    }
+    verdict = state.frames.afterProcess(fd_, sd_bus_is_ready(state.bus.get()) > 0, message != nullptr, result == 0);
+  }
+  if (verdict == FrameLimit::Verdict::tooLarge) {
+    message.reset();
+    end(lock, posixError(EMSGSIZE, "a message is larger than " + std::to_string(maximumMessageSize) + " bytes"), false);
+    return false;
+  }
+  if (!state.loggedIn && sd_bus_is_ready(state.bus.get()) > 0) loggedIn(lock);
+  if (!message) return result > 0;
+  if (state.isFull()) {
+    state.held.push_back(std::move(message));
+    return true;
+  }
+  dispatch(lock, std::move(message));
+  // Whatever comes next lies in the socket, and whoever waits for that sees it.
+  return !(state.frames.atBoundary() && state.held.empty());
+}
+
+void BusConnection::loggedIn(Lock &lock) {
+  State &state = *state_;
+  state.loggedIn = true;
+  std::vector<Task> failures;
+  for (Outgoing &outgoing : std::exchange(state.unsent, {})) failures.push_back(state.transmit(std::move(outgoing)));
+  const std::function<void()> ready = std::exchange(state.readyHandler, {});
+  lock.unlock();
+  if (ready) ready();
+  for (const Task &failure : failures) {
+    if (failure) failure();
+  }
+  lock.lock();
+}
+
+void BusConnection::dispatch(Lock &lock, OwnedMessage message) {
+  std::uint8_t type = 0;
+  sd_bus_message_get_type(message.get(), &type);
+  if (type == SD_BUS_MESSAGE_METHOD_CALL) {
+    dispatchRequest(lock, std::move(message));
+  } else if (type == SD_BUS_MESSAGE_METHOD_RETURN || type == SD_BUS_MESSAGE_METHOD_ERROR) {
+    dispatchReply(lock, std::move(message));
+  }
+}
+
+void BusConnection::end(Lock &lock, const SXError &reason, bool later) {
+  State &state = *state_;
+  if (state.ended) return;
+  state.ended = true;
+  shutdown(fd_, SHUT_RDWR);
+  const bool isOrdinary = reason.code() == ECANCELED || (state.loggedIn && reason.code() == ECONNRESET);
+
+  std::vector<std::unique_ptr<Waiter>> waiters;
+  for (auto &[cookie, waiter] : state.waiting) waiters.push_back(std::move(waiter));
+  for (Outgoing &outgoing : state.unsent) waiters.push_back(std::move(outgoing.waiter));
+  state.waiting.clear();
+  state.unsent.clear();
+  state.held.clear();
+  const auto exports = std::exchange(state.exports, {});
+  const ClosedHandler closed = std::exchange(state.closedHandler, {});
+  const auto ready = std::exchange(state.readyHandler, {});
+  const auto wantedChanged = std::exchange(state.wantedChangedHandler, {});
+  lock.unlock();
+
+  if (!isOrdinary) sx_default_log().notice("[NOTICE] Ended the connection of %@: %@", state.options.peer, reason);
+  std::vector<Task> tasks;
+  tasks.reserve(waiters.size() + 1);
+  for (const auto &waiter : waiters) tasks.push_back(waiter->failed(disconnected(reason.message())));
+  if (closed) tasks.push_back([closed, reason] { closed(reason); });
+  const Task all = [tasks = std::move(tasks)] {
+    for (const Task &task : tasks) {
+      if (task) task();
+    }
+  };
+  if (later) {
+    state.runLater(all);
+  } else {
+    all();
+  }
+  lock.lock();
+}
+
+}  // namespace storix::wire

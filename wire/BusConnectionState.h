@@ -1,0 +1,133 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <deque>
+#include <functional>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <variant>
+#include <vector>
+
+#include "wire/BusConnection.h"
+#include "wire/Codec.h"
+#include "wire/FrameLimit.h"
+#include "wire/SdBus.h"
+
+namespace storix::wire {
+
+/// Requests of the peer that may be in flight before nothing more is read.
+inline constexpr std::size_t maximumRequestsInFlight = 256;
+/// Further ones that sd-bus may read beside the writing that was asked of it.
+inline constexpr std::size_t maximumHeldRequests = 16;
+
+inline std::string_view textOrEmpty(const char *text) { return text ? std::string_view(text) : std::string_view(); }
+
+/// Waits for the answer to one message. One of the two functions is called, once; the task that it
+/// gives runs without the connection's mutex.
+class Waiter {
+ public:
+  virtual ~Waiter() = default;
+  /// With the connection's mutex held.
+  virtual Task answered(sd_bus_message *reply) = 0;
+  virtual Task failed(MethodFailure failure) = 0;
+};
+
+struct Outgoing {
+  OwnedMessage message;
+  std::unique_ptr<Waiter> waiter;
+  bool expectsReply;  ///< Without, the waiter hears only that the message could not be sent.
+};
+
+/// One interface on one object of this end. Does not change once the connection runs.
+struct BusExport {
+  const InterfaceDescription &interface;
+  std::optional<LinkInterface> link;  ///< With `object`, of a protocol.
+  std::shared_ptr<ExportedObject> object;
+  std::vector<BusConnection::MethodHandler> handlers;  ///< Of an interface that is described by hand.
+
+  [[nodiscard]] MessageRow row(std::size_t method, bool ofReply) const {
+    const MethodDescription &description = interface.methods[method];
+    return {*link, link->protocol().operations[method], ofReply ? description.outSignature : description.inSignature,
+            ofReply};
+  }
+};
+
+/// What a request is addressed to, as it lies in the message.
+struct BusTarget {
+  std::string_view path;
+  std::string_view interface;  ///< Empty where the caller leaves it open.
+  std::string_view member;
+
+  [[nodiscard]] bool names(std::string_view wantedInterface, std::string_view wantedMember) const {
+    return member == wantedMember && (interface.empty() || interface == wantedInterface);
+  }
+};
+
+struct BusMethod {
+  std::shared_ptr<const BusExport> exported;
+  std::size_t index;
+};
+
+/// What the mutex guards, all of it but the options.
+struct BusConnection::State {
+  Options options;
+
+  std::mutex mutex;
+  OwnedBus bus;
+  FrameLimit frames;
+  bool loggedIn = false;
+  bool ended = false;
+  std::vector<std::shared_ptr<const BusExport>> exports;
+  std::function<void()> readyHandler;
+  ClosedHandler closedHandler;
+  std::function<void()> wantedChangedHandler;
+
+  // Messages to the peer: those that wait for the login, and by cookie those that wait for an answer.
+  std::deque<Outgoing> unsent;
+  std::map<std::uint64_t, std::unique_ptr<Waiter>> waiting;
+
+  // Requests of the peer.
+  std::size_t requestsInFlight = 0;
+  std::deque<OwnedMessage> held;
+
+  [[nodiscard]] bool isFull() const { return requestsInFlight >= maximumRequestsInFlight; }
+
+  [[nodiscard]] bool hasUnwritten() const {
+    std::uint64_t count = 0;
+    return sd_bus_get_n_queued_write(bus.get(), &count) >= 0 && count > 0;
+  }
+
+  void runLater(Task task) const {
+    if (!task) return;
+    if (options.runLater) {
+      options.runLater(std::move(task));
+    } else {
+      task();
+    }
+  }
+
+  /// Sends the message, or keeps it until the login has ended. Gives what is to be run without the
+  /// mutex when it could not be sent.
+  [[nodiscard]] Task transmit(Outgoing outgoing);
+
+  [[nodiscard]] bool answerByItself(sd_bus_message *request, const BusTarget &target) const;
+  [[nodiscard]] std::variant<BusMethod, MethodFailure> find(const BusTarget &target) const;
+
+  /// Answers a request with a D-Bus error, if it expects an answer.
+  static void replyFailure(sd_bus_message *request, const MethodFailure &failure) {
+    const std::string text = busText(failure.text);
+    const sd_bus_error error = SD_BUS_ERROR_MAKE_CONST(failure.name.c_str(), text.c_str());
+    sd_bus_reply_method_error(request, &error);
+  }
+};
+
+inline MethodFailure disconnected(std::string text) {
+  return {std::string(busErrorName::disconnected), std::move(text)};
+}
+
+}  // namespace storix::wire
