@@ -38,7 +38,9 @@ void DelayTimer::run() {
     if (waiting_.empty()) {
       changed_.wait(lock);
     } else if (waiting_.front().due > Clock::now()) {
-      changed_.wait_until(lock, waiting_.front().due);
+      // A copy: what stands in the heap moves while this waits.
+      const Clock::time_point due = waiting_.front().due;
+      changed_.wait_until(lock, due);
     } else {
       std::pop_heap(waiting_.begin(), waiting_.end(), isLater);
       Task task = std::move(waiting_.back().task);

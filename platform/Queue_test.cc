@@ -603,11 +603,11 @@ TEST(OperationQueue, Promise11RunsOneOperationAtATimeInOrderByDefault) {
 TEST(OperationQueue, Promise11RunsAsManyAsTheMaximumSideBySideAndNoMore) {
   std::atomic<int> inside{0};
   std::atomic<int> tooMany{0};
+  TestCountdown meeting(3);
   {
     ThreadPool pool(8);
     const auto queue = OperationQueue::create(pool, "operations");
     queue->setMaximumConcurrency(3);
-    TestCountdown meeting(3);
     for (int i = 0; i < 200; ++i) {
       queue->addOperation([&inside, &tooMany, &meeting] {
         if (++inside > 3) ++tooMany;
@@ -620,10 +620,10 @@ TEST(OperationQueue, Promise11RunsAsManyAsTheMaximumSideBySideAndNoMore) {
 }
 
 TEST(OperationQueue, Promise11LargerMaximumStartsWhatWaits) {
-  ThreadPool pool(4);
-  const auto queue = OperationQueue::create(pool, "operations");
   TestCountdown first;
   TestCountdown meeting(2);
+  ThreadPool pool(4);
+  const auto queue = OperationQueue::create(pool, "operations");
   for (int i = 0; i < 2; ++i) {
     queue->addOperation([&first, &meeting] {
       first.arrive();

@@ -62,9 +62,9 @@ TEST(ThreadPool, OneThreadRunsTasksInOrder) {
 
 TEST(ThreadPool, AsManyTasksAsItsConcurrencyRunSideBySideAndNoMore) {
   Occupancy occupancy;
+  TestCountdown meeting(3);
   {
     ThreadPool pool(3);
-    TestCountdown meeting(3);
     for (int i = 0; i < 3; ++i) pool.execute([&meeting] { EXPECT_TRUE(meeting.arriveAndWait()); });
     for (int i = 0; i < 300; ++i) {
       pool.execute([&occupancy] {
@@ -210,7 +210,6 @@ TEST(ThreadPool, DestructorStillGivesAPlaceToTheTaskThatAnotherWaitsFor) {
   {
     ThreadPool pool(1);
     TestCountdown started;
-    TestCountdown mayGoOn;
     pool.execute([&pool, &started, &ended] {
       started.arrive();
       TestCountdown released;
