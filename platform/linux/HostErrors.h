@@ -1,0 +1,33 @@
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <string_view>
+
+#include "platform/SXError.h"
+
+namespace storix::linuxhost {
+
+inline constexpr std::string_view platformErrorDomain = "com.tessel.platform";
+
+/// Codes in `platformErrorDomain`: what went wrong on this host where the operating system itself has
+/// no errno for it. Never renumber.
+enum class HostErrorCode : std::int64_t {
+  noExecutable = 1,      ///< the bundle names none, or one outside of itself
+  extensionExited = 2,   ///< the extension's process ended by itself
+  extensionKilled = 3,   ///< a signal ended it
+  loginTimedOut = 4,     ///< it did not finish its login in time
+  connectionClosed = 5,  ///< its connection ended, or never became one
+  startingTooOften = 6,  ///< it failed so often that it is left alone for a while
+  hostEnding = 7,        ///< the daemon is about to end
+  cannotStart = 9,       ///< what the daemon needs in order to start cannot be used; the text says what to do
+  noAnswer = 10,         ///< a provider let go of a question without answering it
+};
+
+/// An error of this host, with a sentence for people.
+inline SXError hostError(HostErrorCode code, std::string description) {
+  return SXError(std::string(platformErrorDomain), static_cast<std::int64_t>(code),
+                 {{"description", Value(std::move(description))}});
+}
+
+}  // namespace storix::linuxhost
