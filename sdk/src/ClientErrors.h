@@ -1,0 +1,18 @@
+#pragma once
+
+#include <string>
+
+#include "storix/Client.h"
+#include "wire/Signature.h"
+
+namespace storix::sdk {
+
+SXError clientError(ClientErrorCode code, std::string sentence, Dictionary details = {});
+
+/// The error of a request that the daemon answered by a D-Bus error, or whose connection ended.
+SXError clientErrorOf(const wire::MethodFailure &failure);
+
+/// The same, for an error that the connection reports for an operation of a protocol.
+SXError clientErrorOf(const SXError &connectionError);
+
+}  // namespace storix::sdk

@@ -1,0 +1,94 @@
+#include "storix/ProviderExtension.h"
+
+#include <cerrno>
+#include <cstdlib>
+#include <filesystem>
+#include <system_error>
+#include <utility>
+
+namespace storix {
+
+namespace {
+
+std::optional<std::string> environmentVariable(const char *name) {
+  const char *value = std::getenv(name);
+  if (!value || !*value) return std::nullopt;
+  return std::string(value);
+}
+
+bool hasPlainComponents(std::string_view path) {
+  while (true) {
+    const std::size_t slash = path.find('/');
+    const std::string_view component = path.substr(0, slash);
+    if (component.empty() || component == "." || component == "..") return false;
+    if (slash == std::string_view::npos) return true;
+    path.remove_prefix(slash + 1);
+  }
+}
+
+std::optional<std::string> below(const std::string &directory, const std::string &path) {
+  if (path.size() <= directory.size() + 1 || !path.starts_with(directory) || path[directory.size()] != '/') {
+    return std::nullopt;
+  }
+  std::string rest = path.substr(directory.size() + 1);
+  return hasPlainComponents(rest) ? std::optional(std::move(rest)) : std::nullopt;
+}
+
+}  // namespace
+
+ProviderEnvironment ProviderEnvironment::ofThisProcess() {
+  return {environmentVariable("STORIX_BUNDLE_PATH").value_or(""), environmentVariable("STORIX_GROUP_CONTAINER")};
+}
+
+void ProviderExtension::performInitialSetup(Completion completion) {
+  const auto url = providedItemsURL();
+  if (!url) return completion(posixError(ENOENT, "looking for the group container of " + environment_.bundlePath));
+  std::error_code failed;
+  std::filesystem::create_directories(url->path(), failed);
+  if (failed) return completion(posixError(failed.value(), "making the directory " + url->path()));
+  completion(std::nullopt);
+}
+
+void ProviderExtension::providePlaceholder(const URL &url, URLCompletion completion) {
+  completion(posixError(ENOTSUP, "making a placeholder for " + url.absoluteString()));
+}
+
+void ProviderExtension::itemChanged(const URL & /*url*/, Completion completion) { completion(std::nullopt); }
+
+void ProviderExtension::stopProviding(const URL & /*url*/, Completion completion) { completion(std::nullopt); }
+
+void ProviderExtension::itemIdentifier(const URL &url, IdentifierCompletion completion) {
+  if (auto path = relativePath(url)) return completion(std::move(*path));
+  completion(posixError(EINVAL, "looking for a document of this provider at " + url.absoluteString()));
+}
+
+void ProviderExtension::itemURL(const std::string &identifier, URLCompletion completion) {
+  const auto directory = providedItemsURL();
+  if (!directory)
+    return completion(posixError(ENOENT, "looking for the group container of " + environment_.bundlePath));
+  if (!hasPlainComponents(identifier) || identifier.find('\0') != std::string::npos) {
+    return completion(posixError(EINVAL, "taking \"" + identifier + "\" for the relative path of a document"));
+  }
+  completion(directory->appendingPathComponent(identifier));
+}
+
+std::optional<URL> ProviderExtension::providedItemsURL() const {
+  if (!environment_.groupContainer) return std::nullopt;
+  const auto container = URL::fileURLWithPath(*environment_.groupContainer, true);
+  if (!container) return std::nullopt;
+  return container->appendingPathComponent("Storix Storage", true);
+}
+
+std::optional<std::string> ProviderExtension::relativePath(const URL &url) const {
+  const auto directory = providedItemsURL();
+  if (!directory) return std::nullopt;
+  if (auto path = below(directory->path(), url.path())) return path;
+  std::error_code failed;
+  const auto resolvedDirectory = std::filesystem::canonical(directory->path(), failed);
+  if (failed) return std::nullopt;
+  const auto resolved = std::filesystem::weakly_canonical(url.path(), failed);
+  if (failed) return std::nullopt;
+  return below(resolvedDirectory.string(), resolved.string());
+}
+
+}  // namespace storix
