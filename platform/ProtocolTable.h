@@ -73,9 +73,8 @@ template <class... Replies>
 ReplyHandler unpackingReply(CompletionHandler<Replies...> handler) {
   if (!handler) return {};
   return [handler = std::move(handler)](Arguments values) {
-    [&]<std::size_t... I>(std::index_sequence<I...>) {
-      handler(argumentAt<Replies>(values, I)...);
-    }(std::index_sequence_for<Replies...>{});
+    [&]<std::size_t... I>(std::index_sequence<I...>) { handler(argumentAt<Replies>(values, I)...); }
+    (std::index_sequence_for<Replies...>{});
   };
 }
 
@@ -108,14 +107,16 @@ class ProtocolTable {
     auto nextName = names.begin();
     [&]<std::size_t... I>(std::index_sequence<I...>) {
       (operation.arguments.push_back({*nextName++, CarriedBy<std::tuple_element_t<I, Taken>>::kind}), ...);
-    }(std::make_index_sequence<argumentCount>{});
+    }
+    (std::make_index_sequence<argumentCount>{});
     for (ValueKind kind : Reply::kinds) operation.replies.push_back({*nextName++, kind});
     description_.operations.push_back(std::move(operation));
     invokers_.push_back([function](P &object, const Arguments &arguments, ReplyHandler reply) {
       [&]<std::size_t... I>(std::index_sequence<I...>) {
         (object.*function)(argumentAt<typename std::tuple_element_t<I, Taken>::value_type>(arguments, I)...,
                            Reply::packing(std::move(reply)));
-      }(std::make_index_sequence<argumentCount>{});
+      }
+      (std::make_index_sequence<argumentCount>{});
     });
     return std::move(*this);
   }
@@ -136,9 +137,7 @@ class ProtocolTable {
   template <class... Rs>
   struct ReplyOf<std::function<void(std::optional<Rs>...)>> {
     static constexpr std::array<ValueKind, sizeof...(Rs)> kinds{ArgumentType<Rs>::kind...};
-    static CompletionHandler<Rs...> packing(ReplyHandler reply) {
-      return packingCompletion<Rs...>(std::move(reply));
-    }
+    static CompletionHandler<Rs...> packing(ReplyHandler reply) { return packingCompletion<Rs...>(std::move(reply)); }
   };
 
   ProtocolDescription description_;

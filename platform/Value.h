@@ -71,8 +71,7 @@ class Value {
   friend bool operator==(const Value &a, const Value &b);
 
  private:
-  std::variant<bool, std::int64_t, double, std::string, URL, Data, List, Dictionary,
-               std::shared_ptr<const SXError>>
+  std::variant<bool, std::int64_t, double, std::string, URL, Data, List, Dictionary, std::shared_ptr<const SXError>>
       content_;
 };
 
