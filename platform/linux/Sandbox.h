@@ -1,16 +1,11 @@
 #pragma once
 
 #include <cstdint>
-#include <map>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
-#include <utility>
 #include <variant>
-
-#include <sys/types.h>
 
 #include "platform/PlatformServices.h"
 #include "platform/linux/Peers.h"
