@@ -59,6 +59,7 @@ using MethodValues = std::vector<MethodValue>;
 struct MethodFailure {
   std::string name;
   std::string text;
+  friend bool operator==(const MethodFailure &, const MethodFailure &) = default;
 };
 
 using MethodResult = std::variant<MethodValues, MethodFailure>;

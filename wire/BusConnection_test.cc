@@ -1,0 +1,662 @@
+#include "wire/BusConnection.h"
+
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/ioctl.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "platform/ProcessScope.h"
+#include "platform/fake/FakePlatform.h"
+#include "providers/_KTStorixVendor.h"
+#include "service/SXDaemon.h"
+#include "wire/Codec.h"
+#include "wire/PlatformInterfaces.h"
+#include "wire/TestConnection.h"
+
+namespace storix::wire {
+namespace {
+
+using testing::Contains;
+using testing::ElementsAre;
+using testing::HasSubstr;
+
+constexpr const char *daemonPath = "/com/tessel/Storix";
+constexpr const char *daemonInterface = "com.tessel.Storix.Daemon";
+
+/// Gives every request to the test, which answers when it likes.
+class RecordingObject : public ExportedObject {
+ public:
+  struct Request {
+    std::size_t operation;
+    Arguments arguments;
+    ReplyHandler reply;
+  };
+  void invoke(std::size_t operation, Arguments arguments, ReplyHandler reply) override {
+    requests.put({operation, std::move(arguments), std::move(reply)});
+  }
+  Received<Request> requests;
+};
+
+/// Answers each request at once with the same values.
+class AnsweringObject : public ExportedObject {
+ public:
+  explicit AnsweringObject(Arguments answer) : answer_(std::move(answer)) {}
+  void invoke(std::size_t, Arguments, ReplyHandler reply) override {
+    if (reply) reply(answer_);
+  }
+
+ private:
+  Arguments answer_;
+};
+
+const ProtocolDescription &daemonProtocol() { return SXDaemonProtocol().description(); }
+std::size_t rowOf(std::string_view method) {
+  return static_cast<std::size_t>(daemonProtocol().operationNamed(method) - daemonProtocol().operations.data());
+}
+
+class BusConnectionTest : public testing::Test {
+ protected:
+  BusConnectionTest() {
+    auto [ours, theirs] = makeSocketPair();
+    peerSocket_ = std::move(theirs);
+    BusConnection::Options options;
+    options.side = BusConnection::Side::server;
+    options.descriptors = BusConnection::Descriptors::passed;
+    options.peer = "pid 42";
+    server_.emplace(pool_, std::move(ours), std::move(options));
+    (*server_)->setClosedHandler([this](const SXError &error) { closed_.put(error); });
+  }
+
+  void exportDaemon(std::shared_ptr<ExportedObject> object) {
+    LinkInterface interface(daemonProtocol());
+    interface.setPermittedKinds({ValueKind::dictionary, ValueKind::string, ValueKind::URL}, SXDaemon::providersName, 1,
+                                true);
+    (*server_)->exportObject(interface, std::move(object));
+    server_->start();
+  }
+
+  /// The other end, driven like the SDK drives it.
+  TestConnection &client() {
+    if (!client_) {
+      BusConnection::Options options;
+      options.descriptors = BusConnection::Descriptors::passed;
+      options.peer = "the daemon";
+      client_.emplace(pool_, std::move(peerSocket_), std::move(options));
+      client_->start();
+    }
+    return *client_;
+  }
+
+  std::shared_ptr<RemoteObject> remote() {
+    return client()->remoteObject(LinkInterface(daemonProtocol()), [this](SXError error) { errors_.put(error); });
+  }
+  ReplyHandler toReplies() {
+    return [this](Arguments values) { replies_.put(std::move(values)); };
+  }
+
+  std::vector<std::string> logTexts() { return platform_->log().texts(); }
+
+  std::unique_ptr<fake::FakePlatform> platform_ = fake::FakePlatform::create();
+  ProcessScope scope_{*platform_};
+  UniqueFd peerSocket_;
+  Received<SXError> closed_;
+  Received<SXError> errors_;
+  Received<Arguments> replies_;
+  std::shared_ptr<RecordingObject> object_ = std::make_shared<RecordingObject>();
+  ThreadPool pool_;
+  std::optional<TestConnection> server_;
+  std::optional<TestConnection> client_;
+};
+
+TEST_F(BusConnectionTest, EveryKindTravelsBothWays) {
+  exportDaemon(object_);
+  const URL url = *URL::fromString("file:///a%20b/%C3%A9");
+  remote()->send(rowOf("ExtendSandboxForFileURL"), {Value(url), Value("org.sample"), std::nullopt}, toReplies());
+  auto request = object_->requests.take();
+  ASSERT_TRUE(request);
+  EXPECT_EQ(request->operation, rowOf("ExtendSandboxForFileURL"));
+  EXPECT_EQ(request->arguments, (Arguments{Value(url), Value("org.sample"), std::nullopt}));
+
+  const SXError error("domain", -7,
+                      {{"description", Value("text")},
+                       {"underlyingError", Value(SXError("other", 1))},
+                       {"list", Value(List{Value(1), Value(true), Value(2.5), Value(Data{"xy"})})},
+                       {"URL", Value(url)}});
+  const Arguments answer{Value(error), Value(Data{std::string("\0\1token", 7)}), Value(url), Value(Data{})};
+  request->reply(answer);
+  EXPECT_EQ(replies_.take(), answer);
+}
+
+TEST_F(BusConnectionTest, AnEmptyStringIsNotAnAbsentOne) {
+  exportDaemon(object_);
+  remote()->send(rowOf("StartProvidingItemAtURL"), {std::nullopt, Value(""), std::nullopt}, toReplies());
+  auto request = object_->requests.take();
+  ASSERT_TRUE(request);
+  EXPECT_EQ(request->arguments, (Arguments{std::nullopt, Value(""), std::nullopt}));
+  request->reply({std::nullopt});
+  EXPECT_EQ(replies_.take(), Arguments{std::nullopt});
+}
+
+TEST_F(BusConnectionTest, RepliesComeLaterFromOtherThreadsAndInAnyOrder) {
+  exportDaemon(object_);
+  const auto remoteObject = remote();
+  constexpr int count = 20;
+  std::vector<RecordingObject::Request> requests;
+  for (int i = 0; i < count; ++i) {
+    remoteObject->send(rowOf("DocumentURLFromBookmarkableString"), {Value(std::to_string(i))}, toReplies());
+  }
+  for (int i = 0; i < count; ++i) {
+    auto request = object_->requests.take();
+    ASSERT_TRUE(request);
+    EXPECT_EQ(request->arguments[0], Value(std::to_string(i))) << "requests are handed over in order";
+    requests.push_back(std::move(*request));
+  }
+  std::vector<std::thread> threads;
+  for (auto &request : requests) {
+    threads.emplace_back([&request] { request.reply({{}, {}, {}, {}, Value(SXInvalidBookmarkableStringError())}); });
+  }
+  for (std::thread &thread : threads) thread.join();
+  for (int i = 0; i < count; ++i) {
+    EXPECT_EQ(replies_.take(), (Arguments{{}, {}, {}, {}, Value(SXInvalidBookmarkableStringError())}));
+  }
+}
+
+TEST_F(BusConnectionTest, SecondReplyIsDropped) {
+  exportDaemon(object_);
+  remote()->send(rowOf("WakeUp"), {}, toReplies());
+  auto request = object_->requests.take();
+  ASSERT_TRUE(request);
+  request->reply({});
+  request->reply({});
+  remote()->send(rowOf("WakeUp"), {}, toReplies());
+  auto second = object_->requests.take();
+  ASSERT_TRUE(second);
+  second->reply({});
+  EXPECT_TRUE(replies_.take());
+  EXPECT_TRUE(replies_.take());
+  EXPECT_EQ(replies_.count(), 0U);
+}
+
+TEST_F(BusConnectionTest, CallWithoutReplyIsARequestWithoutReplyHandler) {
+  exportDaemon(object_);
+  remote()->send(rowOf("WakeUp"), {}, {});
+  auto request = object_->requests.take();
+  ASSERT_TRUE(request);
+  EXPECT_FALSE(request->reply);
+}
+
+TEST_F(BusConnectionTest, EachMessageInFlightHearsOnceThatThePeerIsGone) {
+  exportDaemon(object_);
+  const auto remoteObject = remote();
+  Received<SXError> clientClosed;
+  constexpr int count = 3;
+  for (int i = 0; i < count; ++i) remoteObject->send(rowOf("WakeUp"), {}, toReplies());
+  std::vector<RecordingObject::Request> requests;
+  for (int i = 0; i < count; ++i) requests.push_back(*object_->requests.take());
+  (*server_)->close();
+  for (int i = 0; i < count; ++i) {
+    auto error = errors_.take();
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->domain(), posixErrorDomain);
+    EXPECT_EQ(error->code(), ECONNRESET);
+    EXPECT_THAT(error->message(), HasSubstr("WakeUp"));
+  }
+  client_->join();
+  // Replies after the end are harmless.
+  for (auto &request : requests) request.reply({});
+  EXPECT_EQ(errors_.count(), 0U);
+  EXPECT_EQ(replies_.count(), 0U);
+  EXPECT_TRUE(closed_.take());
+}
+
+TEST_F(BusConnectionTest, MessageToAConnectionThatHasEndedFailsOutsideTheCall) {
+  exportDaemon(object_);
+  const auto remoteObject = remote();
+  client()->close();
+  client_->join();
+  std::mutex inCall;
+  std::unique_lock held(inCall);
+  const auto other = client()->remoteObject(LinkInterface(daemonProtocol()), [this, &inCall](SXError error) {
+    const std::lock_guard lock(inCall);
+    errors_.put(error);
+  });
+  other->send(rowOf("WakeUp"), {}, toReplies());
+  held.unlock();
+  EXPECT_TRUE(errors_.take());
+}
+
+TEST_F(BusConnectionTest, DBusErrorReplyReachesTheErrorHandlerAndSaysWhich) {
+  server_->start();
+  remote()->send(rowOf("WakeUp"), {}, toReplies());
+  auto error = errors_.take();
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->stringDetail("busError"), "org.freedesktop.DBus.Error.UnknownObject");
+  EXPECT_THAT(error->message(), HasSubstr(daemonPath));
+}
+
+TEST_F(BusConnectionTest, ReplyOfAnotherSignatureReachesTheErrorHandler) {
+  static const InterfaceDescription wrong{
+      "com.tessel.Storix.Daemon", "/com/tessel/Storix", {{"WakeUp", {}, {{"surprise", "t"}}}}};
+  (*server_)->exportMethods(wrong, {[](MethodValues, const BusConnection::Reply &reply) {
+                              MethodValues values;
+                              values.emplace_back(std::uint64_t{1});
+                              reply.send(std::move(values));
+                            }});
+  server_->start();
+  remote()->send(rowOf("WakeUp"), {}, toReplies());
+  auto error = errors_.take();
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->stringDetail("busError"), busErrorName::invalidArgs);
+  EXPECT_THAT(error->message(), HasSubstr("signature"));
+  EXPECT_THAT(logTexts(), Contains(HasSubstr("Refused the reply to \"WakeUp\" from the daemon")));
+}
+
+TEST_F(BusConnectionTest, ReplyWithAKindThatIsNotPermittedIsWithheld) {
+  const Dictionary record{{"org.sample", Value(Dictionary{{"count", Value(1)}})}};
+  exportDaemon(std::make_shared<AnsweringObject>(Arguments{std::nullopt, Value(record)}));
+  remote()->send(rowOf("Providers"), {}, toReplies());
+  auto error = errors_.take();
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->stringDetail("busError"), busErrorName::invalidArgs);
+  EXPECT_THAT(logTexts(), Contains(HasSubstr("Withheld the reply to \"Providers\" of pid 42")));
+}
+
+TEST_F(BusConnectionTest, PermittedKindsPass) {
+  const URL url = *URL::fromString("file:///a/");
+  const Dictionary record{{"org.sample", Value(Dictionary{{"name", Value("n")}, {"URL", Value(url)}})}};
+  exportDaemon(std::make_shared<AnsweringObject>(Arguments{std::nullopt, Value(record)}));
+  remote()->send(rowOf("Providers"), {}, toReplies());
+  EXPECT_EQ(replies_.take(), (Arguments{std::nullopt, Value(record)}));
+}
+
+TEST_F(BusConnectionTest, ReplyThatIsTooLargeIsAnErrorAndTheConnectionLives) {
+  exportDaemon(object_);
+  remote()->send(rowOf("ExtendSandboxForFileURL"), {{}, {}, {}}, toReplies());
+  auto request = object_->requests.take();
+  ASSERT_TRUE(request);
+  request->reply({std::nullopt, Value(Data{std::string(maximumMessageSize, 'x')}), std::nullopt, std::nullopt});
+  auto error = errors_.take();
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->stringDetail("busError"), busErrorName::limitsExceeded);
+  remote()->send(rowOf("WakeUp"), {}, toReplies());
+  auto next = object_->requests.take();
+  ASSERT_TRUE(next);
+  next->reply({});
+  EXPECT_TRUE(replies_.take());
+}
+
+TEST_F(BusConnectionTest, CallThatIsTooLargeFailsAndTheConnectionLives) {
+  exportDaemon(object_);
+  const auto remoteObject = remote();
+  remoteObject->send(rowOf("StartProvidingItemAtURL"), {{}, Value(std::string(maximumStringSize + 1, 'x')), {}},
+                     toReplies());
+  auto error = errors_.take();
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->stringDetail("busError"), busErrorName::limitsExceeded);
+  remoteObject->send(rowOf("WakeUp"), {}, toReplies());
+  auto next = object_->requests.take();
+  ASSERT_TRUE(next);
+  next->reply({});
+  EXPECT_TRUE(replies_.take());
+}
+
+TEST_F(BusConnectionTest, RepliesWaitForAPeerThatDoesNotRead) {
+  // Far more than a socket holds, so that most of it has to be written later.
+  const Data large{std::string(900'000, 'x')};
+  exportDaemon(std::make_shared<AnsweringObject>(Arguments{std::nullopt, Value(large), std::nullopt, std::nullopt}));
+  PlainClient plain(std::move(peerSocket_));
+  EXPECT_TRUE(plain.call(plain.message(daemonPath, daemonInterface, "WakeUp")) == nullptr) << "wrong number of values";
+  constexpr int count = 30;
+  int answered = 0;
+  for (int i = 0; i < count; ++i) {
+    const OwnedMessage request = plain.message(daemonPath, daemonInterface, "ExtendSandboxForFileURL");
+    ASSERT_GE(sd_bus_message_append(request.get(), "asasas", 0, 0, 0), 0);
+    const auto countAnswer = [](sd_bus_message *, void *counter, sd_bus_error *) {
+      ++*static_cast<int *>(counter);
+      return 0;
+    };
+    ASSERT_GE(sd_bus_call_async(plain.bus(), nullptr, request.get(), countAnswer, &answered, 60'000'000), 0);
+  }
+  while (answered < count) {
+    const int result = sd_bus_process(plain.bus(), nullptr);
+    ASSERT_GE(result, 0);
+    if (result == 0) {
+      ASSERT_GE(sd_bus_wait(plain.bus(), 60'000'000), 0);
+    }
+  }
+}
+
+TEST_F(BusConnectionTest, TheRequestAfterTheLimitWaitsUntilOneIsAnswered) {
+  constexpr std::size_t limit = 256;
+  exportDaemon(object_);
+  const auto remoteObject = remote();
+  for (std::size_t i = 0; i <= limit; ++i) remoteObject->send(rowOf("WakeUp"), {}, toReplies());
+  std::vector<RecordingObject::Request> requests;
+  for (std::size_t i = 0; i < limit; ++i) requests.push_back(*object_->requests.take());
+  EXPECT_EQ(object_->requests.count(), 0U);
+  EXPECT_FALSE((*server_)->wanted().events & POLLIN) << "nothing more is read";
+  requests.front().reply({});
+  auto last = object_->requests.take();
+  ASSERT_TRUE(last);
+  EXPECT_TRUE(replies_.take());
+}
+
+TEST_F(BusConnectionTest, RequestsLeftUnansweredDoNotCountOnceTheyAreLetGo) {
+  constexpr std::size_t limit = 256;
+  exportDaemon(object_);
+  const auto remoteObject = remote();
+  for (std::size_t i = 0; i <= limit; ++i) remoteObject->send(rowOf("WakeUp"), {}, toReplies());
+  for (std::size_t i = 0; i <= limit; ++i) EXPECT_TRUE(object_->requests.take());
+  EXPECT_EQ(replies_.count(), 0U);
+}
+
+TEST_F(BusConnectionTest, PeerThatGoesWithTooManyRequestsInFlightIsNoticed) {
+  constexpr std::size_t limit = 256;
+  exportDaemon(object_);
+  const auto remoteObject = remote();
+  for (std::size_t i = 0; i < limit; ++i) remoteObject->send(rowOf("WakeUp"), {}, toReplies());
+  std::vector<RecordingObject::Request> requests;
+  for (std::size_t i = 0; i < limit; ++i) requests.push_back(*object_->requests.take());
+  client()->close();
+  EXPECT_TRUE(closed_.take());
+}
+
+TEST_F(BusConnectionTest, TheObjectIsLetGoOfWhenTheConnectionEnds) {
+  const std::weak_ptr<RecordingObject> weak = object_;
+  exportDaemon(std::move(object_));
+  client()->close();
+  EXPECT_TRUE(closed_.take());
+  server_->join();
+  EXPECT_TRUE(weak.expired());
+}
+
+// --- What bad input gets
+
+class BadInputTest : public BusConnectionTest {
+ protected:
+  /// Sends one request to the daemon's interface and gives the name of the error that it got.
+  template <class... Content>
+  std::string refused(const char *member, const char *types, Content... content) {
+    if (!plain_) plain_.emplace(std::move(peerSocket_));
+    const OwnedMessage request = plain_->message(daemonPath, daemonInterface, member);
+    EXPECT_GE(sd_bus_message_append(request.get(), types, content...), 0);
+    EXPECT_EQ(plain_->call(request), nullptr);
+    return plain_->errorName;
+  }
+  void expectStillServed() {
+    EXPECT_EQ(object_->requests.count(), 0U);
+    const OwnedMessage request = plain_->message(daemonPath, daemonInterface, "WakeUp");
+    ASSERT_GE(sd_bus_message_set_expect_reply(request.get(), 0), 0);
+    ASSERT_GE(sd_bus_send(plain_->bus(), request.get(), nullptr), 0);
+    EXPECT_TRUE(object_->requests.take());
+  }
+
+  void sendRaw(const std::string &bytes) const {
+    ASSERT_EQ(write(peerSocket_.get(), bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
+  }
+  /// Those that were sent and that the connection has not taken yet.
+  [[nodiscard]] int bytesLeft() const {
+    int count = 0;
+    EXPECT_EQ(ioctl(peerSocket_.get(), TIOCOUTQ, &count), 0);
+    return count;
+  }
+
+  /// What a client sends to log in, all of it at once.
+  static std::string loginBytes() {
+    std::string hex;
+    for (char digit : std::to_string(getuid())) hex += std::string("3") + digit;
+    return std::string(1, '\0') + "AUTH EXTERNAL " + hex + "\r\nBEGIN\r\n";
+  }
+
+  /// A call of WakeUp that asks for no reply.
+  static std::string wakeUpBytes(char serial) {
+    std::string fields;
+    const auto field = [&fields](char code, char type, const std::string &text) {
+      fields.resize((fields.size() + 7) / 8 * 8);
+      fields += {code, 1, type, 0, static_cast<char>(text.size()), 0, 0, 0};
+      fields += text + '\0';
+    };
+    field(1, 'o', daemonPath);
+    field(2, 's', daemonInterface);
+    field(3, 's', "WakeUp");
+    std::string bytes{'l', 1, 1, 1, 0, 0, 0, 0, serial, 0, 0, 0, static_cast<char>(fields.size()), 0, 0, 0};
+    bytes += fields;
+    bytes.resize((bytes.size() + 7) / 8 * 8);
+    return bytes;
+  }
+
+  std::optional<PlainClient> plain_;
+};
+
+TEST_F(BadInputTest, WrongSignatureIsRefusedWithOneLogLine) {
+  exportDaemon(object_);
+  EXPECT_EQ(refused("WakeUp", "s", "x"), busErrorName::invalidArgs);
+  EXPECT_EQ(plain_->errorText, "the message must have the signature \"\", not \"s\"");
+  EXPECT_THAT(logTexts(),
+              ElementsAre("[NOTICE] Refused \"WakeUp\" of pid 42: the message must have the signature \"\", not \"s\" "
+                          "(org.freedesktop.DBus.Error.InvalidArgs)"));
+  expectStillServed();
+}
+
+TEST_F(BadInputTest, TwoValuesWhereOneMayStandAreRefused) {
+  exportDaemon(object_);
+  EXPECT_EQ(refused("StartProvidingItemAtURL", "asasas", 0, 2, "a", "b", 0), busErrorName::invalidArgs);
+  EXPECT_EQ(plain_->errorText, "the argument \"providerID\" may have one value at most");
+  expectStillServed();
+}
+
+TEST_F(BadInputTest, TextThatIsNoFileURLIsRefusedWithTheReason) {
+  exportDaemon(object_);
+  EXPECT_EQ(refused("StartProvidingItemAtURL", "asasas", 1, "http://a/b", 0, 0), busErrorName::invalidArgs);
+  EXPECT_THAT(plain_->errorText, HasSubstr("the argument \"URL\": "));
+  EXPECT_EQ(refused("StartProvidingItemAtURL", "asasas", 1, "file:///a%00b", 0, 0), busErrorName::invalidArgs);
+  EXPECT_EQ(refused("StartProvidingItemAtURL", "asasas", 1, "", 0, 0), busErrorName::invalidArgs);
+  expectStillServed();
+}
+
+TEST_F(BadInputTest, StringsAndURLsBeyondTheLimitAreRefused) {
+  exportDaemon(object_);
+  const std::string fits(maximumStringSize, 'x');
+  const std::string tooLong = fits + "x";
+  EXPECT_EQ(refused("StartProvidingItemAtURL", "asasas", 0, 1, tooLong.c_str(), 0), busErrorName::limitsExceeded);
+  const std::string url = "file:///" + fits;
+  EXPECT_EQ(refused("StartProvidingItemAtURL", "asasas", 1, url.c_str(), 0, 0), busErrorName::limitsExceeded);
+  expectStillServed();
+}
+
+TEST_F(BadInputTest, UnknownNamesHaveTheErrorsOfDBus) {
+  exportDaemon(object_);
+  EXPECT_EQ(refused("NoSuchMethod", ""), "org.freedesktop.DBus.Error.UnknownMethod");
+  const auto call = [this](const char *path, const char *interface) {
+    EXPECT_EQ(plain_->call(plain_->message(path, interface, "WakeUp")), nullptr);
+    return plain_->errorName;
+  };
+  EXPECT_EQ(call(daemonPath, "org.sample.Other"), "org.freedesktop.DBus.Error.UnknownInterface");
+  EXPECT_EQ(call("/org/sample", daemonInterface), "org.freedesktop.DBus.Error.UnknownObject");
+  expectStillServed();
+}
+
+TEST_F(BadInputTest, MessageBeyondTheLimitEndsTheConnectionWithOneLogLine) {
+  exportDaemon(object_);
+  plain_.emplace(std::move(peerSocket_));
+  ASSERT_NE(plain_->call(plain_->message(daemonPath, "org.freedesktop.DBus.Peer", "Ping")), nullptr);
+  const std::string large(2 * maximumMessageSize, 'x');
+  const OwnedMessage request = plain_->message(daemonPath, daemonInterface, "WakeUp");
+  ASSERT_GE(sd_bus_message_append(request.get(), "s", large.c_str()), 0);
+  EXPECT_EQ(plain_->call(request), nullptr);
+  EXPECT_LT(plain_->lastResult, 0);
+  auto error = closed_.take();
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code(), EMSGSIZE);
+  EXPECT_THAT(logTexts(), ElementsAre(HasSubstr("Ended the connection of pid 42")));
+}
+
+TEST_F(BadInputTest, FirstMessageBeyondTheLimitEndsTheConnection) {
+  exportDaemon(object_);
+  plain_.emplace(std::move(peerSocket_));
+  const std::string large(8 * maximumMessageSize, 'x');
+  const OwnedMessage request = plain_->message(daemonPath, daemonInterface, "WakeUp");
+  ASSERT_GE(sd_bus_message_append(request.get(), "s", large.c_str()), 0);
+  EXPECT_EQ(plain_->call(request), nullptr);
+  auto error = closed_.take();
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code(), EMSGSIZE);
+}
+
+TEST_F(BadInputTest, MessageJustBelowTheLimitIsRead) {
+  exportDaemon(object_);
+  plain_.emplace(std::move(peerSocket_));
+  ASSERT_NE(plain_->call(plain_->message(daemonPath, "org.freedesktop.DBus.Peer", "Ping")), nullptr);
+  const std::string large(maximumMessageSize - 256, 'x');
+  EXPECT_EQ(refused("WakeUp", "s", large.c_str()), busErrorName::invalidArgs);
+  expectStillServed();
+}
+
+TEST_F(BadInputTest, JunkInsteadOfALoginEndsTheConnectionWithOneLogLine) {
+  exportDaemon(object_);
+  ASSERT_EQ(write(peerSocket_.get(), "GET / HTTP/1.1\r\n\r\n", 18), 18);
+  EXPECT_TRUE(closed_.take());
+  EXPECT_THAT(logTexts(), ElementsAre(HasSubstr("Ended the connection of pid 42: ")));
+}
+
+TEST_F(BadInputTest, JunkAfterTheLoginEndsTheConnectionWithOneLogLine) {
+  exportDaemon(object_);
+  sendRaw(loginBytes() + "this is no message, see");
+  EXPECT_TRUE(closed_.take());
+  EXPECT_THAT(logTexts(), ElementsAre(HasSubstr("Ended the connection of pid 42: ")));
+}
+
+TEST_F(BadInputTest, MessagesThatComeWithTheEndOfTheLoginAreServed) {
+  exportDaemon(object_);
+  sendRaw(loginBytes() + wakeUpBytes(1) + wakeUpBytes(2));
+  EXPECT_TRUE(object_->requests.take());
+  EXPECT_TRUE(object_->requests.take());
+  sendRaw(wakeUpBytes(3));
+  EXPECT_TRUE(object_->requests.take());
+}
+
+TEST_F(BadInputTest, MessageInPiecesIsServed) {
+  exportDaemon(object_);
+  const std::string message = wakeUpBytes(1);
+  sendRaw(loginBytes() + message);
+  EXPECT_TRUE(object_->requests.take());
+  for (const std::size_t cut :
+       {std::size_t{1}, std::size_t{15}, std::size_t{16}, std::size_t{17}, message.size() - 1}) {
+    sendRaw(message.substr(0, cut));
+    while (bytesLeft() > 0) std::this_thread::yield();
+    sendRaw(message.substr(cut));
+    EXPECT_TRUE(object_->requests.take());
+  }
+}
+
+// --- What every object answers, and interfaces that are described by hand
+
+class HandMethodsTest : public BusConnectionTest {
+ protected:
+  void exportSandbox(BusConnection::MethodHandler consume, BusConnection::MethodHandler prove) {
+    (*server_)->exportMethods(sandboxInterface(), {std::move(consume), std::move(prove)});
+    server_->start();
+  }
+};
+
+TEST_F(HandMethodsTest, DescriptorsTravelBothWays) {
+  exportSandbox(
+      [](MethodValues values, const BusConnection::Reply &reply) {
+        EXPECT_EQ(std::get<Data>(values[0]).bytes, "token");
+        MethodValues answer;
+        answer.emplace_back(UniqueFd(open("/dev/null", O_RDWR | O_CLOEXEC)));
+        reply.send(std::move(answer));
+      },
+      [](MethodValues values, const BusConnection::Reply &reply) {
+        const int fd = std::get<UniqueFd>(values[0]).get();
+        EXPECT_GE(fd, 3);
+        EXPECT_EQ(fcntl(fd, F_GETFD), FD_CLOEXEC);
+        reply.fail(platformError::noProof, "no proof");
+      });
+  Received<std::shared_ptr<MethodResult>> results;
+  const auto handler = [&results](MethodResult result) {
+    results.put(std::make_shared<MethodResult>(std::move(result)));
+  };
+  MethodValues token;
+  token.emplace_back(Data{"token"});
+  client()->call(sandboxInterface(), consumeMethod, std::move(token), handler);
+  auto consumed = results.take();
+  ASSERT_TRUE(consumed);
+  auto *values = std::get_if<MethodValues>(consumed->get());
+  ASSERT_TRUE(values);
+  const UniqueFd &passed = std::get<UniqueFd>(values->front());
+  EXPECT_EQ(fcntl(passed.get(), F_GETFD), FD_CLOEXEC);
+
+  MethodValues proof;
+  proof.emplace_back(UniqueFd(open("/dev/null", O_RDWR | O_CLOEXEC)));
+  client()->call(sandboxInterface(), proveWriteAccessMethod, std::move(proof), handler);
+  auto refused = results.take();
+  ASSERT_TRUE(refused);
+  const auto *failure = std::get_if<MethodFailure>(refused->get());
+  ASSERT_TRUE(failure);
+  EXPECT_EQ(failure->name, platformError::noProof);
+  EXPECT_EQ(failure->text, "no proof");
+}
+
+TEST_F(HandMethodsTest, ConnectionThatEndsIsTheFailureDisconnected) {
+  Received<BusConnection::Reply> requests;
+  exportSandbox([&requests](MethodValues, BusConnection::Reply reply) { requests.put(std::move(reply)); },
+                [](MethodValues, const BusConnection::Reply &) {});
+  Received<std::string> failures;
+  MethodValues token;
+  token.emplace_back(Data{"token"});
+  client()->call(sandboxInterface(), consumeMethod, std::move(token),
+                 [&failures](const MethodResult &result) { failures.put(std::get<MethodFailure>(result).name); });
+  const auto reply = requests.take();
+  (*server_)->close();
+  EXPECT_EQ(failures.take(), busErrorName::disconnected);
+}
+
+TEST_F(HandMethodsTest, GreetingPingAndIntrospectionAreAnswered) {
+  exportDaemon(object_);
+  PlainClient plain(std::move(peerSocket_));
+  const OwnedMessage hello = plain.call(plain.message("/org/freedesktop/DBus", "org.freedesktop.DBus", "Hello"));
+  ASSERT_NE(hello, nullptr) << plain.errorText;
+  const char *name = nullptr;
+  ASSERT_GT(sd_bus_message_read(hello.get(), "s", &name), 0);
+  EXPECT_TRUE(std::string_view(name).starts_with(":1."));
+  EXPECT_NE(plain.call(plain.message(daemonPath, "org.freedesktop.DBus.Peer", "Ping")), nullptr);
+
+  const auto introspect = [&plain](const char *path) {
+    const OwnedMessage reply = plain.call(plain.message(path, "org.freedesktop.DBus.Introspectable", "Introspect"));
+    const char *xml = nullptr;
+    if (reply) {
+      EXPECT_GT(sd_bus_message_read(reply.get(), "s", &xml), 0);
+    }
+    return std::string(xml ? xml : "");
+  };
+  EXPECT_THAT(introspect("/"), HasSubstr("<node name=\"com\"/>"));
+  EXPECT_THAT(introspect("/com"), HasSubstr("<node name=\"tessel\"/>"));
+  EXPECT_THAT(introspect(daemonPath), HasSubstr("<interface name=\"com.tessel.Storix.Daemon\">"));
+  EXPECT_EQ(introspect("/com/other"), "");
+  EXPECT_EQ(plain.errorName, "org.freedesktop.DBus.Error.UnknownObject");
+}
+
+TEST(BusConnectionStart, SocketOfAPeerThatIsGoneEndsNothingElse) {
+  auto [ours, theirs] = makeSocketPair();
+  theirs.reset();
+  BusConnection::Options options;
+  options.side = BusConnection::Side::server;
+  const int fd = ours.get();
+  auto opened = BusConnection::open(std::move(ours), std::move(options));
+  if (opened) {
+    opened.value()->process();
+    EXPECT_FALSE(opened.value()->isOpen());
+    opened.value()->releaseSocket();
+  }
+  EXPECT_EQ(fcntl(fd, F_GETFD), -1) << "the descriptor is closed";
+}
+
+}  // namespace
+}  // namespace storix::wire
