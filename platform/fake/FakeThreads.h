@@ -35,6 +35,7 @@ class FakeExecutor : public Executor {
   void executeAfter(std::chrono::nanoseconds delay, Task task) override;
   void willBlock() override;
   void didUnblock() override;
+  [[nodiscard]] bool hasThreads() const override { return !manual_; }
 
   /// Runs one task by hand; false when there is none, or when threads run them.
   bool runOne();
