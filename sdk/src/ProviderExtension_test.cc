@@ -266,7 +266,8 @@ TEST_F(ServedExtensionTest, TheEndOfTheConnectionWaitsForCallsUnderWay) {
   std::promise<void> release;
   std::promise<void> holding;
   std::atomic<bool> finished = false;
-  extension_->onStart = [&, go = release.get_future().share()](const URL &, const ProviderExtension::Completion &completion) {
+  extension_->onStart = [&, go = release.get_future().share()](const URL &,
+                                                               const ProviderExtension::Completion &completion) {
     holding.set_value();
     go.wait();
     completion(std::nullopt);
