@@ -377,6 +377,25 @@ TEST(Queue, Promise6SuspensionEndsWithTheLastReference) {
   EXPECT_TRUE(ran);
 }
 
+TEST(Queue, Promise6TaskOfAQueueWithoutReferencesCannotSuspendIt) {
+  ManualExecutor executor;
+  int ran = 0;
+  auto queue = SerialQueue::create(executor, "queue");
+  Queue &reference = *queue;
+  queue->async([&reference, &ran] {
+    reference.suspend();
+    ++ran;
+  });
+  queue->async([&reference, &ran] {
+    reference.resume();
+    reference.suspend();
+    ++ran;
+  });
+  queue.reset();
+  executor.runUntilIdle();
+  EXPECT_EQ(ran, 2);
+}
+
 TEST(Queue, Promise6TaskMayHoldTheLastReferenceToItsOwnQueue) {
   ThreadPool pool;
   for (int i = 0; i < 100; ++i) {
@@ -409,9 +428,13 @@ TEST(Queue, Promise6SynchronousTaskMayDropTheLastReferenceToItsOwnQueue) {
 TEST(Queue, Promise6WhatATaskHoldsIsGoneWhenTheTaskIsOver) {
   ManualExecutor executor;
   const auto queue = SerialQueue::create(executor, "queue");
-  const auto held = std::make_shared<int>(1);
-  queue->async([held] {});
-  queue->sync([&held] { EXPECT_EQ(held.use_count(), 1); });
+  const Queue *whereGone = nullptr;
+  std::shared_ptr<int> held(new int(1), [&whereGone](const int *value) {
+    whereGone = Queue::current();
+    delete value;
+  });
+  queue->async([held = std::move(held)] {});
+  queue->sync([&whereGone, &queue] { EXPECT_EQ(whereGone, queue.get()); });
 }
 
 // 7: waiting tasks
@@ -598,6 +621,23 @@ TEST(OperationQueue, Promise11RunsOneOperationAtATimeInOrderByDefault) {
   }
   EXPECT_EQ(order.size(), 200U);
   EXPECT_TRUE(std::is_sorted(order.begin(), order.end()));
+}
+
+TEST(OperationQueue, Promise11StartsNoOtherOperationInsideOneByDefault) {
+  ManualExecutor executor;
+  const auto queue = OperationQueue::create(executor, "operations");
+  int inside = 0;
+  int ran = 0;
+  for (int i = 0; i < 3; ++i) {
+    queue->addOperation([&executor, &inside, &ran] {
+      EXPECT_EQ(++inside, 1);
+      executor.runUntilIdle();
+      --inside;
+      ++ran;
+    });
+  }
+  executor.runUntilIdle();
+  EXPECT_EQ(ran, 3);
 }
 
 TEST(OperationQueue, Promise11RunsAsManyAsTheMaximumSideBySideAndNoMore) {
