@@ -43,18 +43,25 @@ struct Outgoing {
   bool expectsReply;  ///< Without, the waiter hears only that the message could not be sent.
 };
 
-/// One interface on one object of this end. Does not change once the connection runs.
-struct BusExport {
-  const InterfaceDescription &interface;
-  std::optional<LinkInterface> link;  ///< With `object`, of a protocol.
-  std::shared_ptr<ExportedObject> object;
-  std::vector<BusConnection::MethodHandler> handlers;  ///< Of an interface that is described by hand.
+/// How the messages of an exported interface are read and written. Unchanging; a request keeps its share
+/// until it has been answered.
+struct ExportedInterface {
+  const InterfaceDescription &description;
+  std::optional<LinkInterface> link;  ///< Of a protocol.
 
   [[nodiscard]] MessageRow row(std::size_t method, bool ofReply) const {
-    const MethodDescription &description = interface.methods[method];
-    return {*link, link->protocol().operations[method], ofReply ? description.outSignature : description.inSignature,
+    const MethodDescription &described = description.methods[method];
+    return {*link, link->protocol().operations[method], ofReply ? described.outSignature : described.inSignature,
             ofReply};
   }
+};
+
+/// One interface on one object of this end, and who answers. Does not change once the connection runs,
+/// and is gone when it has ended, whatever has not been answered then.
+struct BusExport {
+  std::shared_ptr<const ExportedInterface> interface;
+  std::shared_ptr<ExportedObject> object;              ///< Of a protocol.
+  std::vector<BusConnection::MethodHandler> handlers;  ///< Of an interface that is described by hand.
 };
 
 /// What a request is addressed to, as it lies in the message.

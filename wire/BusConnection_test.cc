@@ -367,13 +367,18 @@ TEST_F(BusConnectionTest, PeerThatGoesWithTooManyRequestsInFlightIsNoticed) {
   EXPECT_TRUE(closed_.take());
 }
 
-TEST_F(BusConnectionTest, TheObjectIsLetGoOfWhenTheConnectionEnds) {
+TEST_F(BusConnectionTest, TheObjectIsLetGoOfWhenTheConnectionEndsThoughARequestIsUnanswered) {
   const std::weak_ptr<RecordingObject> weak = object_;
-  exportDaemon(std::move(object_));
+  exportDaemon(object_);
+  remote()->send(rowOf("WakeUp"), {}, toReplies());
+  const auto request = object_->requests.take();
+  object_.reset();
   client()->close();
   EXPECT_TRUE(closed_.take());
   server_->join();
   EXPECT_TRUE(weak.expired());
+  ASSERT_TRUE(request);
+  request->reply({});
 }
 
 // --- What bad input gets

@@ -26,9 +26,9 @@ std::string nextGreetedName() {
 
 /// A request that was handed over and expects a reply.
 struct BusConnection::Request {
-  Request(std::shared_ptr<BusConnection> from, std::shared_ptr<const BusExport> to, std::size_t methodIndex,
+  Request(std::shared_ptr<BusConnection> from, std::shared_ptr<const ExportedInterface> to, std::size_t methodIndex,
           OwnedMessage request)
-      : connection(std::move(from)), exported(std::move(to)), method(methodIndex), message(std::move(request)) {}
+      : connection(std::move(from)), interface(std::move(to)), method(methodIndex), message(std::move(request)) {}
   ~Request() { finish({}); }
 
   /// Sends the reply that `append` fills, the first time, or the D-Bus error that `append` gives instead. Nothing is
@@ -39,12 +39,13 @@ struct BusConnection::Request {
     std::optional<MethodFailure> withheld;
     finish([&append, &withheld](sd_bus_message *reply) { return withheld = append(reply); });
     if (!withheld) return;
-    sx_default_log().notice("[NOTICE] Withheld the reply to \"%@\" of %@: %@", exported->interface.methods[method].name,
-                            connection->state_->options.peer, withheld->text);
+    sx_default_log().notice("[NOTICE] Withheld the reply to \"%@\" of %@: %@",
+                            interface->description.methods[method].name, connection->state_->options.peer,
+                            withheld->text);
   }
 
   const std::shared_ptr<BusConnection> connection;
-  const std::shared_ptr<const BusExport> exported;
+  const std::shared_ptr<const ExportedInterface> interface;
   const std::size_t method;
   /// Guarded by the connection's mutex; null once the request has ended.
   OwnedMessage message;
@@ -79,7 +80,7 @@ void BusConnection::Request::finish(const Append &append) {
 
 void BusConnection::Reply::send(MethodValues values) const {
   if (!request_) return;
-  const auto &types = request_->exported->interface.methods[request_->method].out;
+  const auto &types = request_->interface->description.methods[request_->method].out;
   request_->finishWithValues([&types, &values](sd_bus_message *reply) { return appendValues(reply, types, values); });
 }
 
@@ -91,18 +92,19 @@ void BusConnection::Reply::fail(std::string_view errorName, std::string_view tex
 
 void BusConnection::exportObject(LinkInterface interface, std::shared_ptr<ExportedObject> object) {
   const InterfaceDescription &description = interfaceOf(interface.protocol());
+  auto exported = std::make_shared<const ExportedInterface>(ExportedInterface{description, std::move(interface)});
   const std::lock_guard lock(state_->mutex);
-  state_->exports.push_back(
-      std::make_shared<const BusExport>(BusExport{description, std::move(interface), std::move(object), {}}));
+  state_->exports.push_back(std::make_shared<const BusExport>(BusExport{std::move(exported), std::move(object), {}}));
 }
 
 void BusConnection::exportMethods(const InterfaceDescription &interface, std::vector<MethodHandler> handlers) {
   if (handlers.size() != interface.methods.size()) {
     endProcessForProgrammingError("An interface is exported without a handler for each of its methods.");
   }
+  auto exported = std::make_shared<const ExportedInterface>(ExportedInterface{interface, std::nullopt});
   const std::lock_guard lock(state_->mutex);
   state_->exports.push_back(
-      std::make_shared<const BusExport>(BusExport{interface, std::nullopt, nullptr, std::move(handlers)}));
+      std::make_shared<const BusExport>(BusExport{std::move(exported), nullptr, std::move(handlers)}));
 }
 
 /// What every object has, and the greeting of bus tools. True when the request was one of these.
@@ -115,8 +117,9 @@ bool BusConnection::State::answerByItself(sd_bus_message *request, const BusTarg
   std::vector<std::string_view> paths;
   std::vector<const InterfaceDescription *> interfaces;
   for (const auto &candidate : exports) {
-    paths.push_back(candidate->interface.objectPath);
-    if (candidate->interface.objectPath == target.path) interfaces.push_back(&candidate->interface);
+    paths.push_back(candidate->interface->description.objectPath);
+    if (candidate->interface->description.objectPath == target.path)
+      interfaces.push_back(&candidate->interface->description);
   }
   const std::vector<std::string> children = childrenOf(target.path, paths);
   if (interfaces.empty() && children.empty() && target.path != "/") return false;
@@ -130,7 +133,7 @@ std::variant<BusMethod, MethodFailure> BusConnection::State::find(const BusTarge
   bool objectFound = target.path == "/";
   bool interfaceFound = target.interface.empty() || target.interface == introspectableInterface;
   for (const auto &candidate : exports) {
-    const InterfaceDescription &interface = candidate->interface;
+    const InterfaceDescription &interface = candidate->interface->description;
     if (interface.objectPath != target.path) continue;
     objectFound = true;
     if (!target.interface.empty() && interface.name != target.interface) continue;
@@ -170,13 +173,13 @@ void BusConnection::dispatchRequest(Lock &lock, OwnedMessage message) {
   }
   BusMethod &method = std::get<BusMethod>(found);
   if (method.exported->object) {
-    auto read = readArguments(raw, method.exported->row(method.index, false));
+    auto read = readArguments(raw, method.exported->interface->row(method.index, false));
     if (const MethodFailure *wrong = std::get_if<MethodFailure>(&read)) {
       return refuse(lock, std::move(message), *wrong);
     }
     handOver(lock, std::move(message), std::move(method), std::move(std::get<Arguments>(read)));
   } else {
-    const MethodDescription &description = method.exported->interface.methods[method.index];
+    const MethodDescription &description = method.exported->interface->description.methods[method.index];
     auto read = readValues(raw, description.in, description.inSignature);
     if (const MethodFailure *wrong = std::get_if<MethodFailure>(&read)) {
       return refuse(lock, std::move(message), *wrong);
@@ -192,7 +195,8 @@ void BusConnection::handOver(Lock &lock, OwnedMessage message, BusMethod method,
   std::shared_ptr<Request> request;
   if (sd_bus_message_get_expect_reply(message.get()) > 0) {
     ++state_->requestsInFlight;
-    request = std::make_shared<Request>(shared_from_this(), method.exported, method.index, std::move(message));
+    request =
+        std::make_shared<Request>(shared_from_this(), method.exported->interface, method.index, std::move(message));
   }
   message.reset();
   lock.unlock();
@@ -203,7 +207,7 @@ void BusConnection::handOver(Lock &lock, OwnedMessage message, BusMethod method,
     if (request) {
       reply = [request = std::move(request)](const Arguments &answer) {
         request->finishWithValues([&request, &answer](sd_bus_message *filled) {
-          return appendArguments(filled, request->exported->row(request->method, true), answer);
+          return appendArguments(filled, request->interface->row(request->method, true), answer);
         });
       };
     }

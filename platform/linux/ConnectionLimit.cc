@@ -1,0 +1,58 @@
+#include "platform/linux/ConnectionLimit.h"
+
+#include <sys/resource.h>
+
+#include <algorithm>
+
+#include "platform/linux/Sandbox.h"
+
+namespace storix::linuxhost {
+
+namespace {
+
+/// The socket and the peer's pidfd.
+constexpr std::size_t descriptorsPerConnection = 2;
+/// For the daemon's own files, the extensions (a socket, a pidfd and a pipe each), and the files that
+/// clients have proved.
+constexpr std::size_t reservedDescriptors = 512 + Sandbox::proofsAltogether;
+
+}  // namespace
+
+std::size_t ConnectionLimit::connectionsFor(std::size_t descriptors) {
+  const std::size_t reserved = std::min(reservedDescriptors, descriptors / 2);
+  return std::clamp<std::size_t>((descriptors - reserved) / descriptorsPerConnection, 1, mostConnections);
+}
+
+std::size_t ConnectionLimit::connectionsForThisProcess() {
+  constexpr rlim_t wanted = mostConnections * descriptorsPerConnection + reservedDescriptors;
+  rlimit limit{};
+  if (getrlimit(RLIMIT_NOFILE, &limit) != 0) return connectionsFor(1024);
+  if (limit.rlim_cur < wanted) {
+    rlimit raised = limit;
+    raised.rlim_cur = std::min(wanted, limit.rlim_max);
+    if (setrlimit(RLIMIT_NOFILE, &raised) == 0) limit = raised;
+  }
+  return connectionsFor(static_cast<std::size_t>(std::min(limit.rlim_cur, wanted)));
+}
+
+std::optional<ConnectionLimit::Place> ConnectionLimit::take(std::function<void()> whenFree) {
+  const std::lock_guard lock(mutex_);
+  if (free_ == 0) {
+    waiting_.push_back(std::move(whenFree));
+    return std::nullopt;
+  }
+  --free_;
+  return Place(this);
+}
+
+void ConnectionLimit::release() {
+  std::vector<std::function<void()>> waiting;
+  {
+    const std::lock_guard lock(mutex_);
+    ++free_;
+    waiting = std::exchange(waiting_, {});
+  }
+  for (const auto &whenFree : waiting) whenFree();
+}
+
+}  // namespace storix::linuxhost
