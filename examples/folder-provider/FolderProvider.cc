@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <rapidjson/document.h>
 #include <rapidjson/error/en.h>
+#include <rapidjson/pointer.h>
 #include <rapidjson/stringbuffer.h>
 #include <rapidjson/writer.h>
 #include <unistd.h>
@@ -47,11 +48,11 @@ Result<std::string> sourceFolderOfBundle(const std::string &bundlePath) {
   info.Parse<rapidjson::kParseValidateEncodingFlag | rapidjson::kParseIterativeFlag>(text.data(), text.size());
   if (info.HasParseError()) return noSource(file, rapidjson::GetParseError_En(info.GetParseError()));
   if (!info.IsObject()) return noSource(file, "it is not a dictionary");
-  const auto source = info.FindMember("FolderProviderSource");
-  if (source == info.MemberEnd() || !source->value.IsString() || source->value.GetStringLength() == 0) {
+  const rapidjson::Value *source = rapidjson::Pointer("/FolderProviderSource").Get(info);
+  if (!source || !source->IsString() || source->GetStringLength() == 0) {
     return noSource(file, "\"FolderProviderSource\" must name the folder to serve");
   }
-  const std::string path(source->value.GetString(), source->value.GetStringLength());
+  const std::string path(source->GetString(), source->GetStringLength());
   return path.starts_with('/') ? path : bundlePath + "/" + path;
 }
 

@@ -240,6 +240,7 @@ TEST_F(FolderProviderTest, RequestsForOneItemDoNotDisturbEachOther) {
   folder_.write("source/a", std::string(200'000, 'x'));
   provider();
   std::vector<std::thread> threads;
+  threads.reserve(4);
   for (int i = 0; i < 4; ++i) {
     threads.emplace_back([this, i] {
       for (int j = 0; j < 10; ++j) EXPECT_EQ((i + j) % 2 == 0 ? start("a") : stop("a"), std::nullopt);

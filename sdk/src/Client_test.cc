@@ -321,6 +321,7 @@ TEST_F(ClientTest, RequestsOfSeveralThreadsAreAnsweredSideBySide) {
   };
   Client client(options());
   std::vector<std::thread> threads;
+  threads.reserve(4);
   for (int i = 0; i < 4; ++i) {
     threads.emplace_back([&client, i] {
       for (int j = 0; j < 50; ++j) {

@@ -127,9 +127,9 @@ class ServedExtensionTest : public ProviderExtensionTest {
     auto added = loop_.add(UniqueFd(ends[0]), std::move(options));
     ASSERT_TRUE(added.ok());
     connection_ = added.value();
-    vendor_ = std::make_unique<_KTStorixVendorProxy>(connection_->remoteObject(
-        LinkInterface(_KTStorixVendorProtocol().description()),
-        [this](const SXError &error) { ADD_FAILURE() << "not delivered: " << error.message(); }));
+    vendor_ = std::make_unique<_KTStorixVendorProxy>(
+        connection_->remoteObject(LinkInterface(_KTStorixVendorProtocol().description()),
+                                  [](const SXError &error) { ADD_FAILURE() << "not delivered: " << error.message(); }));
     loopThread_ = std::thread([this] { loop_.run(); });
   }
 
