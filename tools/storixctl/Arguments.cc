@@ -1,6 +1,7 @@
 #include "tools/storixctl/Arguments.h"
 
 #include <algorithm>
+#include <cctype>
 #include <cerrno>
 #include <charconv>
 #include <cmath>
@@ -207,7 +208,9 @@ std::string helpText(const HelpRequest &request) {
   }
   const VerbDescription &verb = *request.verb;
   std::string text =
-      "Usage: " + synopsis(verb) + "\n\n" + std::string(verb.summary) + "\n\n" + std::string(verb.details);
+      "Usage: " + synopsis(verb) + "\n\n" + std::string(verb.summary) + ".\n" + std::string(verb.details);
+  const std::size_t firstLetter = text.find("\n\n") + 2;
+  text[firstLetter] = static_cast<char>(std::toupper(static_cast<unsigned char>(text[firstLetter])));
   if (!verb.operands.empty()) text += "\nOperands:\n";
   for (const auto &operand : verb.operands) text += padded(operand.name, 13) + std::string(operand.meaning) + "\n";
   text += "\nOptions:\n";
