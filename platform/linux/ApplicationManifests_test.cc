@@ -1,13 +1,18 @@
 #include "platform/linux/ApplicationManifests.h"
 
-#include <gtest/gtest.h>
+#include <gmock/gmock.h>
 
 #include <cerrno>
 
 #include "platform/linux/TestDirectory.h"
+#include "platform/linux/TestLog.h"
+#include "platform/linux/TestUser.h"
 
 namespace storix::linuxhost {
 namespace {
+
+using ::testing::ElementsAre;
+using ::testing::StartsWith;
 
 class ApplicationManifestsTest : public ::testing::Test {
  protected:
@@ -110,6 +115,37 @@ TEST_F(ApplicationManifestsTest, UnusableManifestIsLeftOutAndTheOthersStay) {
   EXPECT_EQ(identifierFor(program_), "z");
   write("first/a.kvs", program_);
   EXPECT_EQ(identifierFor(program_), "a");
+}
+
+TEST_F(ApplicationManifestsTest, UnusableManifestIsLoggedOnceForEachState) {
+  TestLog log;
+  const std::string path = test_.makeFile("first/a.kvs", "{");
+  for (int i = 0; i < 3; ++i) EXPECT_EQ(manifests_.manifestForIdentifier("a"), std::nullopt);
+  EXPECT_THAT(log.take(), ElementsAre(StartsWith("[NOTICE] Leaving out the application manifest " + path + ": " + path +
+                                                 ": line 1, column 2 (byte 2): ")));
+  test_.makeFile("first/a.kvs", R"({"Executable": "editor"})");
+  for (int i = 0; i < 3; ++i) EXPECT_EQ(manifests_.manifestForIdentifier("a"), std::nullopt);
+  EXPECT_THAT(log.take(), ElementsAre("[NOTICE] Leaving out the application manifest " + path +
+                                      ": \"Executable\" is not an absolute path"));
+  test_.makeFile("first/a.kvs", R"({"Entitlements": ["x"]})");
+  EXPECT_EQ(manifests_.manifestForIdentifier("a"), std::nullopt);
+  EXPECT_THAT(log.take(), ElementsAre("[NOTICE] Leaving out the application manifest " + path +
+                                      ": \"Entitlements\" is not a dictionary"));
+}
+
+TEST_F(ApplicationManifestsTest, DirectoryThatCannotBeReadIsLoggedOnceAndReadWhenItCan) {
+  EXPECT_TRUE(holdsWithoutRoot([] {
+    TestLog log;
+    const TestDirectory own;
+    own.makeFile("applications/a.kvs", "{}");
+    ApplicationManifests manifests({own / "applications"});
+    bool holds = ::chmod((own / "applications").c_str(), 0300) == 0;
+    for (int i = 0; i < 3; ++i) holds = holds && !manifests.manifestForIdentifier("a");
+    const std::vector<std::string> lines = log.take();
+    holds = holds && lines.size() == 1 && lines.front().starts_with("[NOTICE] Application manifests are left out. ");
+    holds = holds && ::chmod((own / "applications").c_str(), 0700) == 0;
+    return holds && manifests.manifestForIdentifier("a");
+  }));
 }
 
 TEST_F(ApplicationManifestsTest, ManifestNeedNotNameAProgram) {

@@ -1,11 +1,13 @@
 #include "platform/linux/DirectoryRelationship.h"
 
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <cerrno>
 
 #include "platform/linux/ResolvedPath.h"
 #include "platform/linux/TestDirectory.h"
+#include "platform/linux/TestUser.h"
 
 namespace storix::linuxhost {
 namespace {
@@ -142,6 +144,18 @@ TEST_F(DirectoryRelationshipTest, WhatCannotBeLookedAtIsAnErrorOfItsOwn) {
   while (longPath.size() < 5000) longPath += "/component";
   EXPECT_EQ(directoryRelationship(URL::fileURLWithPath(directory_), URL::fileURLWithPath(longPath)).error().code(),
             ENAMETOOLONG);
+}
+
+TEST_F(DirectoryRelationshipTest, ForbiddenDirectoryIsNotAnAbsentOne) {
+  EXPECT_TRUE(holdsWithoutRoot([] {
+    const TestDirectory own;
+    const std::string inside = own.makeDirectory("closed/inside");
+    if (::chmod((own / "closed").c_str(), 0) != 0) return false;
+    const auto ofDirectory = directoryRelationship(URL::fileURLWithPath(inside), URL::fileURLWithPath(own.path()));
+    const auto ofItem = directoryRelationship(URL::fileURLWithPath(own.path()), URL::fileURLWithPath(inside + "/a"));
+    ::chmod((own / "closed").c_str(), 0700);
+    return !ofDirectory && ofDirectory.error().code() == EACCES && !ofItem && ofItem.error().code() == EACCES;
+  }));
 }
 
 TEST_F(DirectoryRelationshipTest, AbsentArgumentIsAnError) {

@@ -8,6 +8,8 @@
 
 #include "platform/linux/KeyedValueFile.h"
 #include "platform/linux/TestDirectory.h"
+#include "platform/linux/TestLog.h"
+#include "platform/linux/TestUser.h"
 
 namespace storix::linuxhost {
 namespace {
@@ -123,12 +125,42 @@ TEST(Files, CorruptFileIsStillKeptByTheWriteAfterAFailedOne) {
   EXPECT_EQ(directory.contentOf("a.kvs.corrupt"), "{corrupt");
 }
 
-TEST(Files, FailedWriteAnswersFalse) {
+TEST(Files, FileThatMayNotBeReadIsKeptWhenWrittenOver) {
+  EXPECT_TRUE(holdsWithoutRoot([] {
+    const TestDirectory directory;
+    const std::string path = directory.makeFile("a.kvs", "secret");
+    Files files;
+    bool holds = ::chmod(path.c_str(), 0) == 0 && !files.openFileInputStream(path);
+    holds = holds && files.writeKeyedValueFileAtomically({}, path);
+    holds = holds && ::chmod((directory / "a.kvs.corrupt").c_str(), 0600) == 0;
+    return holds && directory.contentOf("a.kvs.corrupt") == "secret" && directory.contentOf("a.kvs") == "{}\n";
+  }));
+}
+
+TEST(Files, DirectoryThatMayNotBeWrittenLeavesAllAsItWas) {
+  EXPECT_TRUE(holdsWithoutRoot([] {
+    const TestDirectory directory;
+    const std::string path = directory.makeFile("a.kvs", "{}");
+    Files files;
+    bool holds = ::chmod(directory.path().c_str(), 0500) == 0;
+    holds = holds && !files.writeKeyedValueFileAtomically({{"a", 1}}, path);
+    const std::optional<SXError> error = Files::createDirectory(directory / "new", true);
+    holds = holds && error && error->code() == EACCES;
+    ::chmod(directory.path().c_str(), 0700);
+    return holds && directory.names() == std::vector<std::string>{"a.kvs"} && directory.contentOf("a.kvs") == "{}";
+  }));
+}
+
+TEST(Files, FailedWriteAnswersFalseAndSaysWhy) {
+  TestLog log;
   const TestDirectory directory;
   Files files;
   EXPECT_FALSE(files.writeKeyedValueFileAtomically({}, directory / "absent/a.kvs"));
   EXPECT_FALSE(files.writeKeyedValueFileAtomically({{"u", *URL::fromString("file:///a")}}, directory / "a.kvs"));
   EXPECT_TRUE(directory.names().empty());
+  EXPECT_THAT(log.take(), ElementsAre("[NOTICE] Cannot open the directory of “" + (directory / "absent/a.kvs") +
+                                          "”: No such file or directory",
+                                      "[NOTICE] Not keyed-value content: a value of the kind URL cannot be written"));
 }
 
 }  // namespace

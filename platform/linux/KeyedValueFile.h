@@ -26,7 +26,7 @@ inline constexpr std::size_t keyedValueSizeLimit = std::size_t{256} << 20;
 inline constexpr std::int64_t keyedValueFormatErrorCode = 3840;
 
 /// Reads from where the descriptor stands to the end. `name` is what error texts call it.
-Result<Dictionary> readKeyedValues(int fd, std::string_view name);
+Result<Dictionary> readKeyedValues(int fd, std::string_view name, std::size_t sizeLimit = keyedValueSizeLimit);
 
 /// Opens and reads a regular file; never waits for a FIFO's other end.
 Result<Dictionary> readKeyedValueFile(const std::string &path);

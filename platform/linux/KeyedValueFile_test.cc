@@ -7,6 +7,7 @@
 #include <sys/stat.h>
 #include <sys/wait.h>
 
+#include <array>
 #include <cerrno>
 #include <csignal>
 #include <limits>
@@ -192,22 +193,35 @@ TEST(KeyedValueFile, FileOfManyPiecesIsReadAndItsErrorPlaced) {
               HasSubstr("line 20002, column 4 (byte " + std::to_string(text.size() - 3) + ")"));
 }
 
-TEST(KeyedValueFile, FileBeyondTheSizeLimitIsRefused) {
+TEST(KeyedValueFile, FileBeyondTheSizeLimitIsRefusedBeforeItIsRead) {
   const TestDirectory directory;
   const std::string path = directory.makeFile("large.kvs", "{}");
-  // A sparse file: zero bytes are refused as well, so the white space must reach over the limit.
-  const UniqueFd fd(::open(path.c_str(), O_WRONLY | O_CLOEXEC));
-  const std::string blanks(std::size_t{1} << 20, ' ');
-  for (std::size_t at = 2; at < keyedValueSizeLimit - 2; at += blanks.size()) {
-    ASSERT_EQ(::pwrite(fd.get(), blanks.data(), blanks.size(), static_cast<off_t>(at)),
-              static_cast<ssize_t>(blanks.size()));
-  }
-  ASSERT_EQ(::ftruncate(fd.get(), static_cast<off_t>(keyedValueSizeLimit)), 0);
-  EXPECT_TRUE(readKeyedValueFile(path));
-  ASSERT_EQ(::pwrite(fd.get(), " ", 1, static_cast<off_t>(keyedValueSizeLimit)), 1);
+  ASSERT_EQ(::truncate(path.c_str(), static_cast<off_t>(keyedValueSizeLimit) + 1), 0);
   const Result<Dictionary> refused = readKeyedValueFile(path);
   ASSERT_FALSE(refused);
-  EXPECT_THAT(refused.error().message(), HasSubstr("(byte 268435457): the text is longer than 268435456 bytes"));
+  EXPECT_THAT(refused.error().message(), HasSubstr("byte 268435457: the text is longer than 268435456 bytes"));
+
+  const std::string small = directory.makeFile("small.kvs", "{\n}  ");
+  const UniqueFd fd(::open(small.c_str(), O_RDONLY | O_CLOEXEC));
+  EXPECT_FALSE(readKeyedValues(fd.get(), "small.kvs", 4));
+  EXPECT_TRUE(readKeyedValues(fd.get(), "small.kvs", 5));
+}
+
+TEST(KeyedValueFile, TextThatGrowsBeyondTheLimitWhileItIsReadIsRefused) {
+  for (const std::size_t limit : {4U, 5U}) {
+    std::array<int, 2> ends{};
+    ASSERT_EQ(::pipe2(ends.data(), O_CLOEXEC), 0);
+    const UniqueFd readEnd(ends[0]);
+    UniqueFd writeEnd(ends[1]);
+    ASSERT_EQ(::write(writeEnd.get(), "{\n}  ", 5), 5);
+    writeEnd.reset();
+    const Result<Dictionary> result = readKeyedValues(readEnd.get(), "pipe", limit);
+    EXPECT_EQ(result.ok(), limit == 5);
+    if (result) continue;
+    EXPECT_EQ(result.error().code(), keyedValueFormatErrorCode);
+    EXPECT_THAT(result.error().message(),
+                HasSubstr("pipe: line 2, column 3 (byte 5): the text is longer than 4 bytes"));
+  }
 }
 
 TEST(KeyedValueFile, WhatIsNoFileIsRefusedWithoutWaiting) {
@@ -343,7 +357,7 @@ TEST(KeyedValueFile, ManyWritersOfOnePathEachPutAWholeFileInPlace) {
   std::vector<std::thread> writers;
   for (int writer = 0; writer < 4; ++writer) {
     writers.emplace_back([&path, writer] {
-      for (int i = 0; i < 25; ++i) {
+      for (int i = 0; i < 10; ++i) {
         const std::optional<SXError> error =
             writeKeyedValueFile({{"a", std::string(static_cast<std::size_t>(writer * 30000 + i), 'x')}}, path);
         EXPECT_FALSE(error) << error->message();

@@ -24,8 +24,8 @@ class TextStream {
  public:
   using Ch = char;
 
-  explicit TextStream(std::string_view text) : chunk_(text) { limit(); }
-  explicit TextStream(int fd) : fd_(fd), buffer_(chunkBytes) { readChunk(); }
+  explicit TextStream(std::string_view text) : sizeLimit_(keyedValueSizeLimit), chunk_(text) { limit(); }
+  TextStream(int fd, std::size_t sizeLimit) : sizeLimit_(sizeLimit), fd_(fd), buffer_(chunkBytes) { readChunk(); }
 
   [[nodiscard]] char Peek() const { return position_ < chunk_.size() ? chunk_[position_] : '\0'; }
   char Take() {
@@ -44,6 +44,7 @@ class TextStream {
 
   [[nodiscard]] bool atEnd() const { return position_ == chunk_.size(); }
   [[nodiscard]] bool isTooLarge() const { return tooLarge_; }
+  [[nodiscard]] std::size_t sizeLimit() const { return sizeLimit_; }
   [[nodiscard]] int readError() const { return readError_; }
 
   /// In words, counted from 1. No token spans lines, so an offset in the piece before lies in the
@@ -67,9 +68,9 @@ class TextStream {
   }
 
   void limit() {
-    if (chunk_.size() <= keyedValueSizeLimit - chunkOffset_) return;
+    if (chunk_.size() <= sizeLimit_ - chunkOffset_) return;
     tooLarge_ = true;
-    chunk_ = chunk_.substr(0, keyedValueSizeLimit - chunkOffset_);
+    chunk_ = chunk_.substr(0, sizeLimit_ - chunkOffset_);
     fd_ = -1;
   }
 
@@ -87,6 +88,7 @@ class TextStream {
     limit();
   }
 
+  std::size_t sizeLimit_;
   int fd_ = -1;
   std::vector<char> buffer_;
   std::string_view chunk_;
@@ -193,6 +195,10 @@ SXError formatError(std::string_view name, const std::string &place, const std::
                  {{"description", escapedForLog(name) + ": " + place + ": " + problem}});
 }
 
+std::string tooLargeProblem(std::size_t sizeLimit) {
+  return "the text is longer than " + std::to_string(sizeLimit) + " bytes";
+}
+
 /// The parser's words, to stand inside a sentence.
 std::string parserProblem(rapidjson::ParseErrorCode code) {
   std::string words = rapidjson::GetParseError_En(code);
@@ -207,8 +213,7 @@ Result<Dictionary> read(TextStream &stream, std::string_view name) {
       reader.Parse<rapidjson::kParseValidateEncodingFlag | rapidjson::kParseFullPrecisionFlag>(stream, builder);
   if (stream.readError() != 0) return posixError(stream.readError(), "Cannot read " + quotedPath(name));
   if (stream.isTooLarge()) {
-    return formatError(name, stream.placeOf(keyedValueSizeLimit),
-                       "the text is longer than " + std::to_string(keyedValueSizeLimit) + " bytes");
+    return formatError(name, stream.placeOf(stream.sizeLimit()), tooLargeProblem(stream.sizeLimit()));
   }
   if (result.IsError()) {
     const std::string problem = builder.problem().empty() ? parserProblem(result.Code()) : builder.problem();
@@ -221,8 +226,12 @@ Result<Dictionary> read(TextStream &stream, std::string_view name) {
 
 }  // namespace
 
-Result<Dictionary> readKeyedValues(int fd, std::string_view name) {
-  TextStream stream(fd);
+Result<Dictionary> readKeyedValues(int fd, std::string_view name, std::size_t sizeLimit) {
+  struct stat status {};
+  if (::fstat(fd, &status) == 0 && S_ISREG(status.st_mode) && static_cast<std::uint64_t>(status.st_size) > sizeLimit) {
+    return formatError(name, "byte " + std::to_string(sizeLimit + 1), tooLargeProblem(sizeLimit));
+  }
+  TextStream stream(fd, sizeLimit);
   return read(stream, name);
 }
 

@@ -11,6 +11,7 @@
 #include "platform/linux/ApplicationManifests.h"
 #include "platform/linux/TestDirectory.h"
 #include "platform/linux/TestPeers.h"
+#include "platform/linux/TestUser.h"
 
 namespace storix::linuxhost {
 namespace {

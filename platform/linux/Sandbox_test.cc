@@ -10,13 +10,17 @@
 
 #include "platform/linux/ApplicationManifests.h"
 #include "platform/linux/TestDirectory.h"
+#include "platform/linux/TestLog.h"
 #include "platform/linux/TestPeers.h"
+#include "platform/linux/TestUser.h"
 
 namespace storix::linuxhost {
 namespace {
 
 using Kind = SandboxFailure::Kind;
+using ::testing::ElementsAre;
 using ::testing::HasSubstr;
+using ::testing::StartsWith;
 
 constexpr std::string_view writing = "file-write-data";
 
@@ -282,6 +286,16 @@ TEST_F(SandboxTest, OnlyWhatLiesInAGroupContainerGetsAToken) {
   }
   EXPECT_TRUE(tokenFor(test_ / "in/group.a/a")) << "reached by a link, and yet inside";
   EXPECT_TRUE(tokenFor(groups_ + "/group.a/absent/deeper"));
+}
+
+TEST_F(SandboxTest, ReasonForNoTokenIsLogged) {
+  TestLog log;
+  EXPECT_EQ(tokenFor("/etc/passwd"), std::nullopt);
+  EXPECT_EQ(tokenFor(storage_), std::nullopt);
+  EXPECT_EQ(tokenFor("\n[ERROR] x"), std::nullopt);
+  EXPECT_THAT(log.take(), ElementsAre("[INFO] No token for /etc/passwd: it is in no group container",
+                                      "[INFO] No token for " + storage_ + ": it is not a regular file",
+                                      StartsWith("[INFO] No token for \\n[ERROR] x: it cannot be looked at: ")));
 }
 
 TEST_F(SandboxTest, WithoutContainersThereIsNoToken) {

@@ -6,6 +6,7 @@
 #include <cerrno>
 
 #include "platform/linux/TestDirectory.h"
+#include "platform/linux/TestLog.h"
 
 namespace storix::linuxhost {
 namespace {
@@ -133,6 +134,18 @@ TEST(Tokens, KeyThatWasNotWrittenHereIsReplaced) {
   plant(32, 0600);
   EXPECT_EQ(sealerIn(directory).unseal(sealerIn(directory).seal(sample())), sample());
   EXPECT_EQ(directory.contentOf("token-key"), std::string(32, 'k')) << "a good key stays";
+}
+
+TEST(Tokens, ReplacedKeyIsLoggedAndANewOneIsNot) {
+  TestLog log;
+  const TestDirectory directory;
+  sealerIn(directory);
+  sealerIn(directory);
+  EXPECT_THAT(log.take(), ElementsAre());
+  directory.makeFile("token-key", "short");
+  sealerIn(directory);
+  EXPECT_THAT(log.take(), ElementsAre("[NOTICE] Replacing the token key in " + directory.path() +
+                                      ", which was not written by this daemon."));
 }
 
 TEST(Tokens, WithoutAKeyThereIsAnErrorThatNamesTheDirectory) {
