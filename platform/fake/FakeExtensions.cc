@@ -153,6 +153,11 @@ void FakeExtensions::install(FakeExtension extension) {
   }
 }
 
+void FakeExtensions::installBeside(FakeExtension extension) {
+  const std::lock_guard lock(mutex_);
+  installed_.push_back(std::move(extension));
+}
+
 void FakeExtensions::remove(std::string_view identifier) {
   const std::lock_guard lock(mutex_);
   std::erase_if(installed_, [identifier](const FakeExtension &known) { return known.identifier == identifier; });

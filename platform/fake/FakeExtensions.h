@@ -50,6 +50,8 @@ class FakeExtensions {
   /// Adds an extension at the end of the list, or puts it in the place of the one that has the same
   /// identifier. Nobody is told before `deliver`.
   void install(FakeExtension extension);
+  /// Adds it at the end though another may have its identifier, as a host might that found it twice.
+  void installBeside(FakeExtension extension);
   void remove(std::string_view identifier);
 
   /// Whether a discovery is told the list as it begins, without the test's doing; it is at first.

@@ -1,0 +1,84 @@
+#pragma once
+
+#include <gmock/gmock.h>
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "platform/Log.h"
+#include "platform/ProtocolTable.h"
+#include "platform/fake/FakeHostTest.h"
+#include "providers/SXExtensionStorix.h"
+#include "providers/_KTStorixExtensionHostContext.h"
+
+namespace storix {
+
+/// A fake host that knows the context class of provider extensions, and words for its trace.
+class ProvidersTest : public fake::FakeHostTest {
+ protected:
+  explicit ProvidersTest(fake::FakePlatform::Options options = {}) : FakeHostTest(std::move(options)) {
+    platform().registerExtensionContextClass(_KTStorixExtensionHostContext::name,
+                                             _KTStorixExtensionHostContext::contextClass());
+    platform().trace().take();
+  }
+
+  /// Installs a complete provider and makes the object for it; what that did is not in the trace.
+  std::shared_ptr<SXExtensionStorix> makeProvider(const std::string &identifier) {
+    const fake::FakeExtension extension = fake::completeProvider(identifier);
+    platform().extensions().install(extension);
+    std::shared_ptr<SXExtensionStorix> provider =
+        SXExtensionStorix::initWithExtension(platform().extensions().makeRecord(extension));
+    platform().trace().take();
+    platform().log().take();
+    return provider;
+  }
+
+  /// Brings the registry up with complete providers, their directories made; the trace is emptied.
+  void startRegistry(const std::vector<std::string> &identifiers) {
+    for (const std::string &identifier : identifiers) {
+      platform().extensions().install(fake::completeProvider(identifier));
+      platform().files().makeDirectory(storagePath(identifier));
+    }
+    SXExtensionStorix::createInstancesCompletion({});
+    runUntilIdle();
+    platform().trace().take();
+    platform().log().take();
+  }
+
+  std::vector<std::string> trace() { return platform().trace().take(); }
+  std::vector<std::string> logTexts() { return platform().log().texts(); }
+  fake::FakeExtensionProcess &process(const std::string &identifier) {
+    return platform().extensions().process(identifier);
+  }
+
+  /// A handler that enters in the trace what it gets and where it runs: "done ((null), x) on ...".
+  template <class... Values>
+  CompletionHandler<Values...> recording(std::string name) {
+    return [&trace = platform().trace(), name = std::move(name)](std::optional<Values>... values) {
+      trace.add(name + " " + fake::traced(packArguments<Values...>(std::move(values)...)) + " on " +
+                fake::currentContext());
+    };
+  }
+
+  static std::string storagePath(const std::string &identifier) {
+    return "/groups/group." + identifier + "/Storix Storage";
+  }
+  static std::string storageText(const std::string &identifier) {
+    return "file:///groups/group." + identifier + "/Storix%20Storage/";
+  }
+  static URL storageURL(const std::string &identifier) { return *URL::fromString(storageText(identifier)); }
+  static URL itemURL(const std::string &identifier, const std::string &name) {
+    return storageURL(identifier).appendingPathComponent(name);
+  }
+
+  /// An error as a log line and the trace show it.
+  static std::string text(const SXError &error) { return escapedForLog(logDescription(error)); }
+  static SXError someError(const std::string &description) {
+    return SXError("org.sample.errors", 7, {{"description", description}});
+  }
+};
+
+}  // namespace storix

@@ -1,0 +1,154 @@
+#include "service/SXLinkServicer.h"
+
+#include "service/ServicerTest.h"
+
+namespace storix {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::IsEmpty;
+
+class SXLinkServicerTest : public ServicerTest {
+ protected:
+  const std::vector<std::string> both_{readEntitlement, writeEntitlement};
+
+  /// Asks a servicer of its own for a client with these entitlements.
+  bool admits(Dictionary entitlements) {
+    fake::FakePeer peer;
+    peer.entitlements = std::move(entitlements);
+    const std::shared_ptr<fake::FakeClientConnection> client = platform().connections().makeConnection(peer);
+    SXLinkServicer servicer;
+    servicer.setConnection(client);
+    return servicer.clientHasOneOfAllowedEntitlements(both_);
+  }
+};
+
+TEST_F(SXLinkServicerTest, WakeUpIsServedAndAnsweredOnTheGlobalQueue) {
+  connect({});
+  call(SXDaemon::wakeUpName);
+  EXPECT_THAT(trace(),
+              ElementsAre("request peer 100 wakeUpCompletion: ()",
+                          "log debug [DEBUG] Serving: wakeUpCompletion:", reply(SXDaemon::wakeUpName, "()", global)));
+}
+
+TEST_F(SXLinkServicerTest, WakeUpWithoutReplyDoesNothingMore) {
+  connect({});
+  client_->callWithoutReply(SXDaemon::wakeUpName);
+  runUntilIdle();
+  EXPECT_THAT(trace(), ElementsAre("request without reply peer 100 wakeUpCompletion: ()",
+                                   "log debug [DEBUG] Serving: wakeUpCompletion:"));
+}
+
+TEST_F(SXLinkServicerTest, ATrueNumberOrBooleanAdmits) {
+  EXPECT_TRUE(admits({{readEntitlement, true}}));
+  EXPECT_TRUE(admits({{writeEntitlement, 1}}));
+  EXPECT_TRUE(admits({{readEntitlement, false}, {writeEntitlement, 0.5}}));
+}
+
+TEST_F(SXLinkServicerTest, AValueOfAnyOtherKindDoesNotAdmit) {
+  EXPECT_FALSE(admits({{readEntitlement, "true"}}));
+  EXPECT_FALSE(admits({{readEntitlement, "1"}, {writeEntitlement, List{true}}}));
+  EXPECT_FALSE(admits({{readEntitlement, Dictionary{{"x", true}}}}));
+  EXPECT_FALSE(admits({{readEntitlement, false}, {writeEntitlement, 0}}));
+  EXPECT_FALSE(admits({{"com.tessel.storix.other", true}}));
+}
+
+TEST_F(SXLinkServicerTest, EntitlementsAreTriedInOrderUntilOneAdmits) {
+  EXPECT_TRUE(admits({{readEntitlement, true}, {writeEntitlement, true}}));
+  EXPECT_THAT(trace(), ElementsAre("entitlementValue peer 100 com.tessel.storix.acl-read"));
+}
+
+TEST_F(SXLinkServicerTest, ARejectionNamesThePeerAndAllEntitlementsInTheOrderTried) {
+  EXPECT_FALSE(admits({{readEntitlement, false}, {writeEntitlement, false}}));
+  EXPECT_THAT(trace(),
+              ElementsAre("entitlementValue peer 100 com.tessel.storix.acl-read",
+                          "entitlementValue peer 100 com.tessel.storix.acl-write", "peerProcessIdentifier peer 100",
+                          "log fault [ERROR] Rejecting request from PID 100 because it does not have any of these "
+                          "entitlements: (com.tessel.storix.acl-read, com.tessel.storix.acl-write)"));
+}
+
+TEST_F(SXLinkServicerTest, WithoutAConnectionEveryEntitlementIsAbsentAndThePIDIsZero) {
+  SXLinkServicer servicer;
+  EXPECT_EQ(servicer.connection(), nullptr);
+  EXPECT_FALSE(servicer.clientHasOneOfAllowedEntitlements({writeEntitlement}));
+  EXPECT_THAT(logTexts(), ElementsAre("[ERROR] Rejecting request from PID 0 because it does not have any of these "
+                                      "entitlements: (com.tessel.storix.acl-write)"));
+}
+
+TEST_F(SXLinkServicerTest, TheConnectionAndTheServerAreHeldWeakly) {
+  SXLinkServicer servicer;
+  std::shared_ptr<fake::FakeClientConnection> client = platform().connections().makeConnection({});
+  servicer.setConnection(client);
+  servicer.setServer(server_);
+  EXPECT_EQ(servicer.connection(), client);
+  EXPECT_EQ(servicer.server(), server_);
+  client.reset();
+  server_.reset();
+  EXPECT_EQ(servicer.connection(), nullptr);
+  EXPECT_EQ(servicer.server(), nullptr);
+}
+
+TEST_F(SXLinkServicerTest, TheSandboxCheckAsksForWritingOfThePathWithoutAReport) {
+  const std::shared_ptr<fake::FakeClientConnection> client = platform().connections().makeConnection({});
+  SXLinkServicer servicer;
+  servicer.setConnection(client);
+  const std::optional<URL> url = URL::fromString("file:///a%20b");
+  platform().sandbox().allowAccess(client->auditToken(), "/a b");
+  EXPECT_TRUE(servicer.clientHasSandboxAccessToFile(url));
+  EXPECT_THAT(trace(),
+              ElementsAre("peerAuditToken peer 100", "checkSandboxAccess peer 100 file-write-data pathNoReport /a b"));
+  for (int answer : {1, -1}) {
+    platform().sandbox().setAccessAnswer(client->auditToken(), "/a b", answer);
+    EXPECT_FALSE(servicer.clientHasSandboxAccessToFile(url));
+  }
+  EXPECT_THAT(logTexts(), IsEmpty());
+}
+
+TEST_F(SXLinkServicerTest, TheSandboxCheckOfAGoneConnectionOrAnAbsentURLIsAskedAllTheSame) {
+  SXLinkServicer servicer;
+  platform().sandbox().allowAccess(AuditToken{}, "/x");
+  EXPECT_TRUE(servicer.clientHasSandboxAccessToFile(URL::fromString("file:///x")));
+  EXPECT_FALSE(servicer.clientHasSandboxAccessToFile(std::nullopt));
+  EXPECT_THAT(trace(), ElementsAre("checkSandboxAccess no peer file-write-data pathNoReport /x",
+                                   "checkSandboxAccess no peer file-write-data pathNoReport "));
+}
+
+TEST(SXDaemonProtocol, HasItsNineOperationsInOrder) {
+  struct Row {
+    std::string_view name;
+    std::vector<ValueKind> arguments;
+    std::vector<ValueKind> replies;
+  };
+  using enum ValueKind;
+  const auto url = ValueKind::URL;
+  const std::vector<Row> rows{
+      {"wakeUpCompletion:", {}, {}},
+      {"extendSandboxForFileURL:fromProviderID:toConsumerID:completionHandler:",
+       {url, string, string},
+       {error, data, url, data}},
+      {"providePlaceholderForItemAtURL:fromProviderID:forConsumerID:completionHandler:",
+       {url, string, string},
+       {error}},
+      {"startProvidingItemAtURL:fromProviderID:forConsumerID:completionHandler:", {url, string, string}, {error}},
+      {"stopProvidingItemAtURL:fromProviderID:forConsumerID:completionHandler:", {url, string, string}, {error}},
+      {"providersCompletionHandler:", {}, {error, dictionary}},
+      {"extendBookmarkForFileURL:toConsumerID:completionHandler:", {url, string}, {string, error}},
+      {"bookmarkableStringFromDocumentURL:completion:", {url}, {string, error}},
+      {"documentURLFromBookmarkableString:completion:", {string}, {url, data, url, data, error}},
+  };
+  const std::vector<OperationDescription> &operations = SXDaemonProtocol().description().operations;
+  const auto kinds = [](const std::vector<ArgumentDescription> &arguments) {
+    std::vector<ValueKind> list;
+    for (const ArgumentDescription &argument : arguments) list.push_back(argument.kind);
+    return list;
+  };
+  ASSERT_EQ(operations.size(), rows.size());
+  for (std::size_t i = 0; i < rows.size(); ++i) {
+    EXPECT_EQ(operations[i].name, rows[i].name);
+    EXPECT_EQ(kinds(operations[i].arguments), rows[i].arguments) << rows[i].name;
+    EXPECT_EQ(kinds(operations[i].replies), rows[i].replies) << rows[i].name;
+  }
+}
+
+}  // namespace
+}  // namespace storix
