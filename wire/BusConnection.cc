@@ -128,8 +128,8 @@ bool BusConnection::step(Lock &lock) {
     return false;
   }
 
-  FrameLimit::Verdict verdict = state.frames.beforeProcess(fd_);
-  if (verdict == FrameLimit::Verdict::nothing && !writes) return false;
+  FrameLimit::Verdict verdict = state.frames.beforeProcess(fd_, writes);
+  if (verdict == FrameLimit::Verdict::nothing) return false;
   OwnedMessage message;
   int result = 0;
   if (verdict != FrameLimit::Verdict::tooLarge) {

@@ -138,7 +138,7 @@ class BusConnection : public std::enable_shared_from_this<BusConnection> {
   void loggedIn(Lock &lock);
   void dispatch(Lock &lock, OwnedMessage message);
   void dispatchRequest(Lock &lock, OwnedMessage message);
-  void refuse(Lock &lock, OwnedMessage message, const MethodFailure &failure);
+  void refuse(OwnedMessage message, const MethodFailure &failure) const;
   void handOver(Lock &lock, OwnedMessage message, BusMethod method, std::variant<Arguments, MethodValues> content);
   void dispatchReply(Lock &lock, OwnedMessage message);
   void end(Lock &lock, const SXError &reason, bool later);

@@ -220,10 +220,11 @@ TEST_F(BusConnectionTest, MessageToAConnectionThatHasEndedFailsOutsideTheCall) {
   const auto remoteObject = remote();
   client()->close();
   client_->join();
-  std::mutex inCall;
-  std::unique_lock held(inCall);
-  const auto other = client()->remoteObject(LinkInterface(daemonProtocol()), [this, &inCall](SXError error) {
-    const std::lock_guard lock(inCall);
+  // A call on this thread would find the mutex locked for ever.
+  const auto inCall = std::make_shared<std::mutex>();
+  std::unique_lock held(*inCall);
+  const auto other = client()->remoteObject(LinkInterface(daemonProtocol()), [this, inCall](SXError error) {
+    const std::lock_guard lock(*inCall);
     errors_.put(error);
   });
   other->send(rowOf("WakeUp"), {}, toReplies());

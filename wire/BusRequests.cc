@@ -36,12 +36,15 @@ struct BusConnection::Request {
   void finish(const Append &append);
 
   void finishWithValues(const Append &append) {
-    std::optional<MethodFailure> withheld;
-    finish([&append, &withheld](sd_bus_message *reply) { return withheld = append(reply); });
-    if (!withheld) return;
-    sx_default_log().notice("[NOTICE] Withheld the reply to \"%@\" of %@: %@",
-                            interface->description.methods[method].name, connection->state_->options.peer,
-                            withheld->text);
+    finish([this, &append](sd_bus_message *reply) {
+      std::optional<MethodFailure> withheld = append(reply);
+      if (withheld) {
+        sx_default_log().notice("[NOTICE] Withheld the reply to \"%@\" of %@: %@",
+                                interface->description.methods[method].name, connection->state_->options.peer,
+                                withheld->text);
+      }
+      return withheld;
+    });
   }
 
   const std::shared_ptr<BusConnection> connection;
@@ -152,14 +155,11 @@ std::variant<BusMethod, MethodFailure> BusConnection::State::find(const BusTarge
   return MethodFailure{SD_BUS_ERROR_UNKNOWN_METHOD, "there is no method \"" + std::string(target.member) + "\""};
 }
 
-void BusConnection::refuse(Lock &lock, OwnedMessage message, const MethodFailure &failure) {
-  const std::string member(textOrEmpty(sd_bus_message_get_member(message.get())));
-  State::replyFailure(message.get(), failure);
-  message.reset();
-  lock.unlock();
-  sx_default_log().notice("[NOTICE] Refused \"%@\" of %@: %@ (%@)", member, state_->options.peer, failure.text,
+void BusConnection::refuse(OwnedMessage message, const MethodFailure &failure) const {
+  sx_default_log().notice("[NOTICE] Refused \"%@\" of %@: %@ (%@)",
+                          textOrEmpty(sd_bus_message_get_member(message.get())), state_->options.peer, failure.text,
                           failure.name);
-  lock.lock();
+  State::replyFailure(message.get(), failure);
 }
 
 void BusConnection::dispatchRequest(Lock &lock, OwnedMessage message) {
@@ -168,21 +168,21 @@ void BusConnection::dispatchRequest(Lock &lock, OwnedMessage message) {
                          textOrEmpty(sd_bus_message_get_member(raw))};
   auto found = state_->find(target);
   if (const MethodFailure *missing = std::get_if<MethodFailure>(&found)) {
-    if (!state_->answerByItself(raw, target)) refuse(lock, std::move(message), *missing);
+    if (!state_->answerByItself(raw, target)) refuse(std::move(message), *missing);
     return;
   }
   BusMethod &method = std::get<BusMethod>(found);
   if (method.exported->object) {
     auto read = readArguments(raw, method.exported->interface->row(method.index, false));
     if (const MethodFailure *wrong = std::get_if<MethodFailure>(&read)) {
-      return refuse(lock, std::move(message), *wrong);
+      return refuse(std::move(message), *wrong);
     }
     handOver(lock, std::move(message), std::move(method), std::move(std::get<Arguments>(read)));
   } else {
     const MethodDescription &description = method.exported->interface->description.methods[method.index];
     auto read = readValues(raw, description.in, description.inSignature);
     if (const MethodFailure *wrong = std::get_if<MethodFailure>(&read)) {
-      return refuse(lock, std::move(message), *wrong);
+      return refuse(std::move(message), *wrong);
     }
     handOver(lock, std::move(message), std::move(method), std::move(std::get<MethodValues>(read)));
   }

@@ -1,6 +1,5 @@
 #include "wire/FrameLimit.h"
 
-#include <sys/ioctl.h>
 #include <sys/socket.h>
 
 #include <array>
@@ -30,60 +29,69 @@ std::size_t messageSize(const FixedHeader &header) {
   return fixedHeaderSize + ((fields + 7) & ~std::size_t{7}) + body;
 }
 
-std::size_t bytesInSocket(int fd) {
-  int count = 0;
-  return ioctl(fd, FIONREAD, &count) == 0 && count > 0 ? static_cast<std::size_t>(count) : 0;
+/// The kernel moves the offset for peeking back by every byte that is taken from the socket: an exact
+/// count of what somebody else reads there. Far enough away that it never reaches 0.
+constexpr int countingOffset = 1 << 30;
+
+void startCounting(int fd) { setsockopt(fd, SOL_SOCKET, SO_PEEK_OFF, &countingOffset, sizeof countingOffset); }
+
+void stopCounting(int fd) {
+  constexpr int none = -1;
+  setsockopt(fd, SOL_SOCKET, SO_PEEK_OFF, &none, sizeof none);
+}
+
+std::size_t countedBytes(int fd) {
+  int offset = countingOffset;
+  socklen_t length = sizeof offset;
+  getsockopt(fd, SOL_SOCKET, SO_PEEK_OFF, &offset, &length);
+  return offset >= 0 && offset < countingOffset ? static_cast<std::size_t>(countingOffset - offset) : 0;
 }
 
 }  // namespace
 
-FrameLimit::Verdict FrameLimit::beforeProcess(int fd) {
-  switch (position_) {
-    case Position::login:
-    case Position::inMessage:
-      return Verdict::read;
-    case Position::afterLogin:
-    case Position::unknown:
-      pending_ = bytesInSocket(fd);
-      return Verdict::read;
-    case Position::boundary:
-      break;
-  }
+FrameLimit::Verdict FrameLimit::beforeProcess(int fd, bool hasUnwritten) {
+  if (position_ != Position::boundary) return Verdict::read;
   FixedHeader header{};
   const ssize_t count = recv(fd, header.data(), header.size(), MSG_PEEK | MSG_DONTWAIT);
-  if (count < 0 && (errno == EAGAIN || errno == EINTR)) return Verdict::nothing;
+  if (count < 0 && (errno == EAGAIN || errno == EINTR) && !hasUnwritten) return Verdict::nothing;
   if (count == static_cast<ssize_t>(header.size()) && (header[0] == 'l' || header[0] == 'B')) {
     if (messageSize(header) > maximumMessageSize) return Verdict::tooLarge;
     position_ = Position::inMessage;
     return Verdict::read;
   }
-  // The end, an error, junk or a part of a header: sd-bus finds out.
+  // The end, an error, junk, or a part of a header: sd-bus finds out. Or nothing yet, but sd-bus may
+  // meet something when it has written.
   position_ = Position::unknown;
-  pending_ = bytesInSocket(fd);
+  startCounting(fd);
   return Verdict::read;
 }
 
 FrameLimit::Verdict FrameLimit::afterProcess(int fd, bool loggedIn, bool gotMessage, bool drained) {
-  if (position_ == Position::login) {
-    if (!loggedIn) return Verdict::read;
-    position_ = Position::afterLogin;
-    counted_ = 0;
-    pending_ = 0;
+  switch (position_) {
+    case Position::login:
+      if (!loggedIn) return Verdict::read;
+      position_ = Position::afterLogin;
+      startCounting(fd);
+      return Verdict::read;
+    case Position::afterLogin:
+    case Position::unknown:
+      if (countedBytes(fd) > maximumMessageSize) return Verdict::tooLarge;
+      break;
+    case Position::boundary:
+    case Position::inMessage:
+      break;
   }
-  const bool counting = position_ == Position::afterLogin || position_ == Position::unknown;
-  if (counting && (gotMessage || drained)) {
-    counted_ += pending_;
-    const std::size_t left = gotMessage && counted_ > maximumMessageSize ? bytesInSocket(fd) : 0;
-    if (counted_ > maximumMessageSize + left) return Verdict::tooLarge;
+  if (gotMessage && position_ != Position::afterLogin) {
+    if (position_ == Position::unknown) stopCounting(fd);
+    position_ = Position::boundary;
+  } else if (gotMessage || position_ == Position::inMessage) {
+    // There may be more in what was read ahead; or a part of the message is missing, or sd-bus has
+    // dropped or answered it by itself.
+    if (position_ == Position::inMessage) position_ = Position::unknown;
+    startCounting(fd);
+  } else if (drained) {
+    position_ = Position::unknown;
   }
-  if (gotMessage) {
-    counted_ = 0;
-    if (position_ != Position::afterLogin) position_ = Position::boundary;
-    return Verdict::read;
-  }
-  // sd-bus may hold a part of a message now, or may have dropped or answered one by itself.
-  if (!counting) counted_ = 0;
-  if (drained || !counting) position_ = Position::unknown;
   return Verdict::read;
 }
 
