@@ -355,6 +355,7 @@ TEST(KeyedValueFile, ManyWritersOfOnePathEachPutAWholeFileInPlace) {
   const std::string path = directory / "a.kvs";
   ASSERT_EQ(writeKeyedValueFile({{"a", "start"}}, path), std::nullopt);
   std::vector<std::thread> writers;
+  writers.reserve(4);
   for (int writer = 0; writer < 4; ++writer) {
     writers.emplace_back([&path, writer] {
       for (int i = 0; i < 10; ++i) {

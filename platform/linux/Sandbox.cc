@@ -127,12 +127,12 @@ Result<std::unique_ptr<Sandbox>> Sandbox::create(std::shared_ptr<const PeerTable
                                                  const std::string &runtimeDirectory, std::string groupContainers) {
   Result<TokenSealer> sealer = TokenSealer::open(runtimeDirectory);
   if (!sealer) return sealer.error();
-  return std::unique_ptr<Sandbox>(new Sandbox(std::move(peers), std::move(sealer.value()), std::move(groupContainers)));
+  return std::unique_ptr<Sandbox>(new Sandbox(std::move(peers), sealer.value(), std::move(groupContainers)));
 }
 
-Sandbox::Sandbox(std::shared_ptr<const PeerTable> peers, TokenSealer sealer, std::string groupContainers)
+Sandbox::Sandbox(std::shared_ptr<const PeerTable> peers, const TokenSealer &sealer, std::string groupContainers)
     : peers_(std::move(peers)),
-      sealer_(std::move(sealer)),
+      sealer_(sealer),
       groupContainers_(std::move(groupContainers)),
       proofs_(std::make_shared<ProofTable>()) {}
 

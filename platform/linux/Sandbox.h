@@ -63,7 +63,7 @@ class Sandbox {
   class ProofTable;
   class ConnectionProofs;
 
-  Sandbox(std::shared_ptr<const PeerTable> peers, TokenSealer sealer, std::string groupContainers);
+  Sandbox(std::shared_ptr<const PeerTable> peers, const TokenSealer &sealer, std::string groupContainers);
 
   std::shared_ptr<const PeerTable> peers_;
   TokenSealer sealer_;
