@@ -40,7 +40,7 @@ struct ThreadPool::Implementation {
         timer([this](Task task) { submit(std::move(task)); }) {}
 
   void submit(Task task);
-  void finish();
+  void end();
 
   // Under the mutex:
   void putOneToWork();
@@ -68,6 +68,7 @@ struct ThreadPool::Implementation {
   std::condition_variable allEnded;
   std::size_t working = 0;
   bool ending = false;
+  bool over = false;  // what comes now is dropped
 
   DelayTimer timer;
 };
@@ -78,6 +79,7 @@ constinit thread_local unsigned ThreadPool::Implementation::blocked = 0;
 
 void ThreadPool::Implementation::submit(Task task) {
   const std::lock_guard lock(mutex);
+  if (over) return;
   ready.push_back(std::move(task));
   putOneToWork();
 }
@@ -143,7 +145,7 @@ void ThreadPool::Implementation::endThread(std::unique_lock<std::mutex> &lock, T
   for (std::thread &thread : earlier) thread.join();
 }
 
-void ThreadPool::Implementation::finish() {
+void ThreadPool::Implementation::end() {
   timer.stop();
   std::unique_lock lock(mutex);
   ending = true;
@@ -158,6 +160,7 @@ void ThreadPool::Implementation::finish() {
     task();
     lock.lock();
   }
+  over = true;
   Threads last;
   last.swap(ended);
   lock.unlock();
@@ -179,7 +182,9 @@ void ThreadPool::Implementation::submitAllLocalTasks() {
 ThreadPool::ThreadPool(std::size_t concurrency, std::chrono::nanoseconds idleTime)
     : implementation_(std::make_unique<Implementation>(concurrency, idleTime)) {}
 
-ThreadPool::~ThreadPool() { implementation_->finish(); }
+ThreadPool::~ThreadPool() { implementation_->end(); }
+
+void ThreadPool::end() { implementation_->end(); }
 
 void ThreadPool::execute(Task task) {
   LocalTasks::State *local = Implementation::blocked == 0 ? implementation_->localTasks() : nullptr;

@@ -16,8 +16,12 @@ class ThreadPool : public Executor {
   /// and two at least. A thread that had no work for `idleTime` ends.
   explicit ThreadPool(std::size_t concurrency = 0, std::chrono::nanoseconds idleTime = std::chrono::seconds(10));
 
-  /// Runs what was given to `execute`, drops what waits for its delay, and ends all threads.
+  /// As `end`.
   ~ThreadPool() override;
+
+  /// Drops what waits for its delay, runs what was given to `execute` and what that gives, and ends all
+  /// threads. What comes later is dropped unrun. Not from a task of the pool; a second call does nothing.
+  void end();
 
   void execute(Task task) override;
   void executeAfter(std::chrono::nanoseconds delay, Task task) override;

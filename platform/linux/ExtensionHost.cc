@@ -1,5 +1,6 @@
 #include "platform/linux/ExtensionHost.h"
 
+#include <algorithm>
 #include <chrono>
 #include <csignal>
 #include <map>
@@ -55,7 +56,7 @@ struct ExtensionHost::Implementation : ExtensionSurroundings, std::enable_shared
     };
     const std::lock_guard lock(mutex);
     if (isEnding) return nullptr;
-    processes.insert(process);
+    processes.emplace(process, bundle.identifier);
     process->start(std::move(description), std::move(handlers));
     return process;
   }
@@ -69,7 +70,8 @@ struct ExtensionHost::Implementation : ExtensionSurroundings, std::enable_shared
     std::set<std::shared_ptr<ExtensionProcess>> ending;
     {
       const std::lock_guard lock(mutex);
-      ending.swap(processes);
+      for (const auto &[process, identifier] : processes) ending.insert(process);
+      processes.clear();
     }
     for (const auto &process : ending) process->endNow(SIGTERM);
     waitFor(ending, timeAfterTermination);
@@ -93,7 +95,8 @@ struct ExtensionHost::Implementation : ExtensionSurroundings, std::enable_shared
 
   std::mutex mutex;
   bool isEnding = false;
-  std::set<std::shared_ptr<ExtensionProcess>> processes;
+  /// With the identifiers of their extensions.
+  std::map<std::shared_ptr<ExtensionProcess>, std::optional<std::string>> processes;
   std::map<std::string, ExtensionContextClass, std::less<>> contextClasses;
 
   std::unique_ptr<ExtensionDiscovery> discovery;
@@ -128,6 +131,15 @@ std::shared_ptr<BundleRecord> ExtensionHost::bundleRecordForIdentifier(const std
 void ExtensionHost::registerExtensionContextClass(std::string_view name, ExtensionContextClass contextClass) {
   const std::lock_guard lock(implementation_->mutex);
   implementation_->contextClasses.insert_or_assign(std::string(name), std::move(contextClass));
+}
+
+bool ExtensionHost::isProcessOfExtension(std::string_view identifier, pid_t process) const {
+  if (process <= 0) return false;
+  const std::lock_guard lock(implementation_->mutex);
+  return std::any_of(implementation_->processes.begin(), implementation_->processes.end(),
+                     [identifier, process](const auto &entry) {
+                       return entry.second == identifier && entry.first->processIdentifier() == process;
+                     });
 }
 
 }  // namespace storix::linuxhost

@@ -1,5 +1,7 @@
 #pragma once
 
+#include <sys/types.h>
+
 #include <memory>
 #include <optional>
 #include <string>
@@ -29,6 +31,10 @@ class ExtensionHost {
                                                              ExtensionMatchingHandler handler);
   std::shared_ptr<BundleRecord> bundleRecordForIdentifier(const std::optional<std::string> &identifier);
   void registerExtensionContextClass(std::string_view name, ExtensionContextClass contextClass);
+
+  /// Whether that is the number of a process that was started for the extension and is not reaped yet,
+  /// so that it means no other process.
+  [[nodiscard]] bool isProcessOfExtension(std::string_view identifier, pid_t process) const;
 
  private:
   struct Implementation;

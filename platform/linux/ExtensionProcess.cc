@@ -84,7 +84,8 @@ void ExtensionProcess::launched(LaunchedProcess process) {
     const std::lock_guard lock(outputMutex_);
     output_ = std::move(process.output);
   }
-  std::optional<SXError> error;
+  std::optional<SXError> notWatched;
+  std::optional<SXError> notConnected;
   bool isTooLate = false;
   {
     const std::lock_guard lock(mutex_);
@@ -99,15 +100,17 @@ void ExtensionProcess::launched(LaunchedProcess process) {
     });
     isTooLate = state_ == State::ending;
     if (!exitWatch_ || !outputWatch_) {
-      error = posixError(ENOMEM, "watching the process of the extension " + name_);
+      notWatched = posixError(ENOMEM, "watching the process of the extension " + name_);
+      state_ = State::ending;
     } else if (!isTooLate) {
       state_ = State::loggingIn;
-      error = openConnection();
+      notConnected = openConnection();
     }
-    if (error) state_ = State::ending;
   }
-  if (error) settle(*error, true);
-  if (error || isTooLate) closeConnectionAndEscalate();
+  if (notWatched) settle(*notWatched, true);
+  if (notWatched || isTooLate) closeConnectionAndEscalate();
+  // A process that is gone already, for instance: its exit will say more.
+  if (notConnected) connectionEnded(*notConnected);
 }
 
 std::optional<SXError> ExtensionProcess::openConnection() {
@@ -345,6 +348,11 @@ bool ExtensionProcess::isUsable() const {
 std::shared_ptr<wire::BusConnection> ExtensionProcess::connection() const {
   const std::lock_guard lock(mutex_);
   return wasReady_ ? connection_ : nullptr;
+}
+
+pid_t ExtensionProcess::processIdentifier() const {
+  const std::lock_guard lock(mutex_);
+  return isGone_ ? 0 : processIdentifier_;
 }
 
 void ExtensionProcess::whenCauseIsKnown(std::function<void(SXError)> handler) {

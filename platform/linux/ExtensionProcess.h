@@ -70,6 +70,9 @@ class ExtensionProcess : public std::enable_shared_from_this<ExtensionProcess> {
   /// Null until the login has succeeded.
   [[nodiscard]] std::shared_ptr<wire::BusConnection> connection() const;
 
+  /// 0 before it is started and once it is reaped.
+  [[nodiscard]] pid_t processIdentifier() const;
+
   /// Calls `handler` when it is known why the connection has ended; at once if it is known already.
   void whenCauseIsKnown(std::function<void(SXError)> handler);
 

@@ -95,8 +95,8 @@ Task answering(ClaimHandler handler, ClaimOutcome outcome) {
 
 class FileCoordination::State : public std::enable_shared_from_this<State> {
  public:
-  State(Executor &executor, ProviderProcess providerProcess)
-      : executor_(executor), providerProcess_(std::move(providerProcess)) {}
+  State(Executor &executor, IsProviderProcess isProviderProcess)
+      : executor_(executor), isProviderProcess_(std::move(isProviderProcess)) {}
 
   void end();
   void addProvider(std::shared_ptr<KTStorix> object);
@@ -129,7 +129,7 @@ class FileCoordination::State : public std::enable_shared_from_this<State> {
   void run(Afterwards &afterwards);
 
   Executor &executor_;
-  const ProviderProcess providerProcess_;
+  const IsProviderProcess isProviderProcess_;
 
   mutable std::mutex mutex_;
   std::condition_variable callbackEnded_;
@@ -246,10 +246,9 @@ std::shared_ptr<RegisteredProvider> FileCoordination::State::providerOf(std::str
 
 bool FileCoordination::State::isProcessOf(const RegisteredProvider &provider,
                                           const std::shared_ptr<const Peer> &peer) const {
-  if (!peer || !provider.identifier || !providerProcess_) return false;
-  const std::optional<pid_t> process = providerProcess_(*provider.identifier);
+  if (!peer || !provider.identifier || !isProviderProcess_) return false;
   // The peer had its number before the question and has it after the answer, so the number was its own.
-  return process && *process == peer->processIdentifier() && peer->isAlive();
+  return isProviderProcess_(*provider.identifier, peer->processIdentifier()) && peer->isAlive();
 }
 
 void FileCoordination::State::ask(const std::shared_ptr<RegisteredProvider> &provider, QuestionNumber question, URL url,
@@ -508,8 +507,8 @@ class FileCoordination::ConnectionClaims : public FileClaims {
   const ConnectionNumber number_;
 };
 
-FileCoordination::FileCoordination(Executor &executor, ProviderProcess providerProcess)
-    : state_(std::make_shared<State>(executor, std::move(providerProcess))) {}
+FileCoordination::FileCoordination(Executor &executor, IsProviderProcess isProviderProcess)
+    : state_(std::make_shared<State>(executor, std::move(isProviderProcess))) {}
 
 FileCoordination::~FileCoordination() { state_->end(); }
 

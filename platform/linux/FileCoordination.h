@@ -68,12 +68,12 @@ class FileCoordination : public FileCoordinationService {
   /// Path components that the claims of all connections may have together.
   static constexpr std::size_t componentsAltogether = std::size_t{1} << 18;
 
-  /// The process of the extension that is the provider with that identifier, while it has one: a child
-  /// that has not been waited for, so that its number means no other process.
-  using ProviderProcess = std::function<std::optional<pid_t>(const std::string &providerIdentifier)>;
+  /// Whether that is the number of a process of the extension that is the provider with that identifier:
+  /// of a child that has not been waited for, so that the number means no other process.
+  using IsProviderProcess = std::function<bool(const std::string &providerIdentifier, pid_t process)>;
 
   /// `executor` must outlive the service.
-  FileCoordination(Executor &executor, ProviderProcess providerProcess);
+  FileCoordination(Executor &executor, IsProviderProcess isProviderProcess);
   ~FileCoordination() override;
 
   void addProvider(std::shared_ptr<KTStorix> provider) override;

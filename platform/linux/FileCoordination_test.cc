@@ -92,7 +92,7 @@ struct Begun {
 
 class FileCoordinationTest : public testing::Test {
  protected:
-  FileCoordinationTest() : coordination_(std::make_unique<FileCoordination>(executor_, processFinder())) {
+  FileCoordinationTest() : coordination_(std::make_unique<FileCoordination>(executor_, isProviderProcess())) {
     directory_.makeDirectory("storage");
     provider_ = makeProvider("storage");
     coordination_->addProvider(provider_);
@@ -100,10 +100,9 @@ class FileCoordinationTest : public testing::Test {
     others_ = coordination_->claimsOf(nullptr);
   }
 
-  FileCoordination::ProviderProcess processFinder() {
-    return [this](const std::string &identifier) -> std::optional<pid_t> {
-      if (identifier == ownProvider_) return ::getpid();
-      return std::nullopt;
+  FileCoordination::IsProviderProcess isProviderProcess() {
+    return [this](const std::string &identifier, pid_t process) {
+      return identifier == ownProvider_ && process == ::getpid();
     };
   }
 

@@ -207,7 +207,9 @@ IoLoop::IoLoop(ThreadPool &pool) : implementation_(std::make_shared<Implementati
   implementation_->startThread(implementation_);
 }
 
-IoLoop::~IoLoop() {
+IoLoop::~IoLoop() { end(); }
+
+void IoLoop::end() {
   std::list<std::thread> threads;
   {
     const std::lock_guard lock(implementation_->mutex);

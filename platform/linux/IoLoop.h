@@ -33,8 +33,12 @@ class IoLoop {
   /// `pool` must outlive the loop.
   explicit IoLoop(ThreadPool &pool);
 
-  /// Ends the threads. Watches must not be used afterwards, but may still be destroyed.
+  /// As `end`. Watches must not be used afterwards, but may still be destroyed.
   ~IoLoop();
+
+  /// Waits for the handlers that run, and ends the threads: no handler starts afterwards, though watches
+  /// may still be made, changed and destroyed. Not from a handler; a second call does nothing.
+  void end();
 
   /// Level-triggered: calls the handler as long as the descriptor is ready. The descriptor stays the
   /// caller's and must live as long as the watch. Null when the kernel refuses.

@@ -34,15 +34,15 @@ std::optional<SXError> unfitness(const std::string &path, const struct stat &fou
   }
   if (!S_ISDIR(found.st_mode)) return refusal(path, "is not a directory; remove what is there, " + elsewhere);
   if (found.st_uid != ::geteuid()) {
-    return refusal(path, "belongs to user " + std::to_string(found.st_uid) + " and not to user " +
-                             std::to_string(::geteuid()) + ", as whom the daemon runs; remove it, " + elsewhere);
+    return refusal(path, "belongs to another user, " + std::to_string(found.st_uid) + "; the daemon runs as user " +
+                             std::to_string(::geteuid()) + ". Remove it, " + elsewhere);
   }
   const mode_t mode = found.st_mode & 0777;
   if (mode != 0700) {
     std::array<char, 8> octal{};
     (void)std::snprintf(octal.data(), octal.size(), "%04o", mode);
     const std::string whatIsWrong = (mode & 077) != 0 ? "lets other users in" : "keeps its own user out";
-    return refusal(path, whatIsWrong + " (its mode is " + octal.data() + "); change its mode to 0700, " + elsewhere);
+    return refusal(path, whatIsWrong + " (its mode is " + octal.data() + "); chmod 700 it, " + elsewhere);
   }
   return std::nullopt;
 }

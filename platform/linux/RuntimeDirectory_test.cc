@@ -60,7 +60,7 @@ TEST_F(RuntimeDirectoryTest, ExistingDirectoryIsUsedAsItIs) {
 TEST_F(RuntimeDirectoryTest, DirectoryThatLetsOthersInIsRefused) {
   fs::create_directory(path_);
   ::chmod(path_.c_str(), 0750);
-  EXPECT_THAT(refusalOf(path_), AllOf(HasSubstr("lets other users in"), HasSubstr("0750"), HasSubstr("to 0700")));
+  EXPECT_THAT(refusalOf(path_), AllOf(HasSubstr("lets other users in"), HasSubstr("0750"), HasSubstr("chmod 700")));
 }
 
 TEST_F(RuntimeDirectoryTest, DirectoryThatKeepsItsUserOutIsRefused) {
@@ -90,7 +90,7 @@ TEST_F(RuntimeDirectoryTest, DirectoryOfAnotherUserIsRefused) {
     ASSERT_EQ(::chown(path_.c_str(), 12345, 12345), 0);
     foreign = path_;
   }
-  EXPECT_THAT(refusalOf(foreign), AllOf(HasSubstr("belongs to user"), HasSubstr("STORIX_RUNTIME_DIR")));
+  EXPECT_THAT(refusalOf(foreign), AllOf(HasSubstr("belongs to another user"), HasSubstr("STORIX_RUNTIME_DIR")));
 }
 
 TEST_F(RuntimeDirectoryTest, MissingParentIsSaid) {
