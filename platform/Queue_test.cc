@@ -5,9 +5,7 @@
 
 #include <algorithm>
 #include <atomic>
-#include <functional>
 #include <memory>
-#include <mutex>
 #include <thread>
 #include <vector>
 
@@ -15,6 +13,7 @@
 #include "platform/OnceToken.h"
 #include "platform/TestAllocations.h"
 #include "platform/TestCountdown.h"
+#include "platform/TestThreads.h"
 #include "platform/ThreadPool.h"
 
 namespace storix {
@@ -24,22 +23,10 @@ using std::chrono::milliseconds;
 using std::chrono::nanoseconds;
 using testing::ElementsAre;
 
-class ThreadsafeDeathTest : public testing::Test {
+class QueueDeathTest : public testing::Test {
  protected:
-  ThreadsafeDeathTest() { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
+  QueueDeathTest() { GTEST_FLAG_SET(death_test_style, "threadsafe"); }
 };
-using QueueDeathTest = ThreadsafeDeathTest;
-
-std::vector<std::thread> threads(int count, const std::function<void(int)> &body) {
-  std::vector<std::thread> result;
-  result.reserve(static_cast<std::size_t>(count));
-  for (int i = 0; i < count; ++i) result.emplace_back(body, i);
-  return result;
-}
-
-void join(std::vector<std::thread> threads) {
-  for (std::thread &thread : threads) thread.join();
-}
 
 // 1: order
 
@@ -212,7 +199,7 @@ TEST(Queue, Promise4SerialTasksSeeWhatEarlierOnesWrote) {
   ThreadPool pool(4);
   const auto queue = SerialQueue::create(pool, "queue");
   int count = 0;
-  join(threads(4, [&queue, &count](int) {
+  join(startThreads(4, [&queue, &count](int) {
     for (int i = 0; i < 500; ++i) {
       int before = -1;
       queue->sync([&count, &before] { before = count++; });
@@ -229,7 +216,7 @@ TEST(Queue, Promise4PlainTasksAndBarriersSeeEachOthersWrites) {
   ThreadPool pool(4);
   const auto queue = ConcurrentQueue::create(pool, "queue");
   std::vector<int> slots(5, 0);
-  join(threads(4, [&queue, &slots](int number) {
+  join(startThreads(4, [&queue, &slots](int number) {
     const auto slot = static_cast<std::size_t>(number);
     for (int i = 0; i < 200; ++i) {
       queue->sync([&slots, slot] { ++slots[slot]; });
@@ -299,7 +286,7 @@ TEST(Queue, Promise5SynchronousTaskWaitsWhileSuspended) {
   concurrent->suspend();
   TestCountdown waiting(3);
   const auto check = [&resumed] { EXPECT_TRUE(resumed); };
-  auto callers = threads(3, [&serial, &concurrent, &waiting, &check](int i) {
+  auto callers = startThreads(3, [&serial, &concurrent, &waiting, &check](int i) {
     waiting.arrive();
     if (i == 0) serial->sync(check);
     if (i == 1) concurrent->sync(check);
@@ -437,294 +424,6 @@ TEST(Queue, Promise6WhatATaskHoldsIsGoneWhenTheTaskIsOver) {
   queue->sync([&whereGone, &queue] { EXPECT_EQ(whereGone, queue.get()); });
 }
 
-// 7: waiting tasks
-
-TEST(Queue, Promise7TasksThatWaitInSyncNeverKeepOthersFromRunningHoweverMany) {
-  constexpr std::size_t count = 500;
-  ThreadPool pool(2);
-  const auto gate = SerialQueue::create(pool, "gate");
-  const auto global = ConcurrentQueue::create(pool, "global");
-  gate->suspend();
-  int passed = 0;
-  TestCountdown done(count);
-  for (std::size_t i = 0; i < count; ++i) {
-    global->async([&gate, &passed, &done] {
-      gate->sync([&passed] { ++passed; });
-      done.arrive();
-    });
-  }
-  global->async([&gate] { gate->resume(); });
-  EXPECT_TRUE(done.wait());
-  EXPECT_EQ(passed, 500);
-}
-
-TEST(Queue, Promise7TaskMayWaitForATaskThatWaitsForATask) {
-  constexpr std::size_t depth = 60;
-  ThreadPool pool(1);
-  std::vector<std::shared_ptr<SerialQueue>> queues;
-  for (std::size_t i = 0; i < depth; ++i) queues.push_back(SerialQueue::create(pool, "queue"));
-  // Every queue's first task waits for the next queue's, so all must be started before one can end.
-  std::vector<TestCountdown> started(depth);
-  TestCountdown done(depth);
-  for (std::size_t i = 0; i < depth; ++i) {
-    queues[i]->async([&pool, &queues, &started, &done, i] {
-      started[i].arrive();
-      if (i + 1 < depth) {
-        {
-          const BlockingScope blocking(pool);
-          EXPECT_TRUE(started[i + 1].wait());
-        }
-        queues[i + 1]->sync([] {});
-      }
-      done.arrive();
-    });
-  }
-  EXPECT_TRUE(done.wait());
-}
-
-// 8: serial queues
-
-TEST(Queue, Promise8SerialQueueRunsOneTaskAtATime) {
-  ThreadPool pool(4);
-  const auto queue = SerialQueue::create(pool, "queue");
-  std::atomic<int> inside{0};
-  std::atomic<int> collisions{0};
-  const auto task = [&inside, &collisions] {
-    if (++inside != 1) ++collisions;
-    std::this_thread::yield();
-    --inside;
-  };
-  join(threads(4, [&queue, &task](int) {
-    for (int i = 0; i < 200; ++i) {
-      queue->async(task);
-      queue->sync(task);
-    }
-  }));
-  queue->sync([] {});
-  EXPECT_EQ(collisions, 0);
-}
-
-// 9: plain tasks
-
-TEST(Queue, Promise9AsynchronousPlainTasksRunSideBySide) {
-  ThreadPool pool(4);
-  const auto queue = ConcurrentQueue::create(pool, "queue");
-  TestCountdown meeting(4);
-  TestCountdown done(4);
-  for (int i = 0; i < 4; ++i) {
-    queue->async([&meeting, &done] {
-      EXPECT_TRUE(meeting.arriveAndWait());
-      done.arrive();
-    });
-  }
-  EXPECT_TRUE(done.wait());
-}
-
-TEST(Queue, Promise9SynchronousPlainTasksRunSideBySide) {
-  ThreadPool pool;
-  const auto queue = ConcurrentQueue::create(pool, "queue");
-  TestCountdown meeting(4);
-  join(threads(4, [&queue, &meeting](int) { queue->sync([&meeting] { EXPECT_TRUE(meeting.arriveAndWait()); }); }));
-}
-
-TEST(Queue, Promise9PlainTasksThatWaitedForABarrierRunSideBySide) {
-  ThreadPool pool(4);
-  const auto queue = ConcurrentQueue::create(pool, "queue");
-  queue->suspend();
-  queue->asyncBarrier([] {});
-  TestCountdown meeting(4);
-  TestCountdown submitted(2);
-  for (int i = 0; i < 2; ++i) queue->async([&meeting] { EXPECT_TRUE(meeting.arriveAndWait()); });
-  auto callers = threads(2, [&queue, &meeting, &submitted](int) {
-    submitted.arrive();
-    queue->sync([&meeting] { EXPECT_TRUE(meeting.arriveAndWait()); });
-  });
-  EXPECT_TRUE(submitted.wait());
-  queue->resume();
-  join(std::move(callers));
-  queue->syncBarrier([] {});
-}
-
-// 10: barriers
-
-TEST(Queue, Promise10BarrierWaitsForTheEndOfAllBeforeItAndHoldsBackAllAfterIt) {
-  ThreadPool pool(4);
-  const auto queue = ConcurrentQueue::create(pool, "queue");
-  std::mutex mutex;
-  std::vector<int> order;
-  const auto note = [&mutex, &order](int what) {
-    const std::lock_guard lock(mutex);
-    order.push_back(what);
-  };
-  TestCountdown started(2);
-  TestCountdown mayEnd;
-  TestCountdown done(2);
-  for (int i = 0; i < 2; ++i) {
-    queue->async([&started, &mayEnd, &note] {
-      started.arrive();
-      EXPECT_TRUE(mayEnd.wait());
-      note(1);
-    });
-  }
-  ASSERT_TRUE(started.wait());
-  queue->asyncBarrier([&note] { note(2); });
-  for (int i = 0; i < 2; ++i) {
-    queue->async([&note, &done] {
-      note(3);
-      done.arrive();
-    });
-  }
-  mayEnd.arrive();
-  EXPECT_TRUE(done.wait());
-  EXPECT_THAT(order, ElementsAre(1, 1, 2, 3, 3));
-}
-
-TEST(Queue, Promise10BarriersRunAlone) {
-  ThreadPool pool(4);
-  const auto queue = ConcurrentQueue::create(pool, "queue");
-  std::atomic<int> plain{0};
-  std::atomic<int> barriers{0};
-  std::atomic<int> collisions{0};
-  const auto plainTask = [&plain, &barriers, &collisions] {
-    ++plain;
-    if (barriers != 0) ++collisions;
-    std::this_thread::yield();
-    --plain;
-  };
-  const auto barrierTask = [&plain, &barriers, &collisions] {
-    if (++barriers != 1 || plain != 0) ++collisions;
-    std::this_thread::yield();
-    --barriers;
-  };
-  join(threads(4, [&queue, &plainTask, &barrierTask](int) {
-    for (int i = 0; i < 100; ++i) {
-      queue->async(plainTask);
-      queue->sync(plainTask);
-      queue->asyncBarrier(barrierTask);
-      queue->sync(plainTask);
-      queue->syncBarrier(barrierTask);
-    }
-  }));
-  queue->syncBarrier([] {});
-  EXPECT_EQ(collisions, 0);
-}
-
-// 11: operation queues
-
-TEST(OperationQueue, Promise11RunsOneOperationAtATimeInOrderByDefault) {
-  std::vector<int> order;
-  {
-    ThreadPool pool(4);
-    const auto queue = OperationQueue::create(pool, "operations");
-    EXPECT_EQ(queue->name(), "operations");
-    for (int i = 0; i < 200; ++i) queue->addOperation([&order, i] { order.push_back(i); });
-  }
-  EXPECT_EQ(order.size(), 200U);
-  EXPECT_TRUE(std::is_sorted(order.begin(), order.end()));
-}
-
-TEST(OperationQueue, Promise11StartsNoOtherOperationInsideOneByDefault) {
-  ManualExecutor executor;
-  const auto queue = OperationQueue::create(executor, "operations");
-  int inside = 0;
-  int ran = 0;
-  for (int i = 0; i < 3; ++i) {
-    queue->addOperation([&executor, &inside, &ran] {
-      EXPECT_EQ(++inside, 1);
-      executor.runUntilIdle();
-      --inside;
-      ++ran;
-    });
-  }
-  executor.runUntilIdle();
-  EXPECT_EQ(ran, 3);
-}
-
-TEST(OperationQueue, Promise11RunsAsManyAsTheMaximumSideBySideAndNoMore) {
-  std::atomic<int> inside{0};
-  std::atomic<int> tooMany{0};
-  TestCountdown meeting(3);
-  {
-    ThreadPool pool(8);
-    const auto queue = OperationQueue::create(pool, "operations");
-    queue->setMaximumConcurrency(3);
-    for (int i = 0; i < 200; ++i) {
-      queue->addOperation([&inside, &tooMany, &meeting] {
-        if (++inside > 3) ++tooMany;
-        EXPECT_TRUE(meeting.arriveAndWait());
-        --inside;
-      });
-    }
-  }
-  EXPECT_EQ(tooMany, 0);
-}
-
-TEST(OperationQueue, Promise11LargerMaximumStartsWhatWaits) {
-  TestCountdown first;
-  TestCountdown meeting(2);
-  ThreadPool pool(4);
-  const auto queue = OperationQueue::create(pool, "operations");
-  for (int i = 0; i < 2; ++i) {
-    queue->addOperation([&first, &meeting] {
-      first.arrive();
-      EXPECT_TRUE(meeting.arriveAndWait());
-    });
-  }
-  ASSERT_TRUE(first.wait());
-  queue->setMaximumConcurrency(2);
-  EXPECT_TRUE(meeting.wait());
-}
-
-TEST(OperationQueue, Promise11SmallerMaximumHoldsFromTheNextStartOnAndZeroCountsAsOne) {
-  ManualExecutor executor;
-  const auto queue = OperationQueue::create(executor, "operations");
-  queue->setMaximumConcurrency(3);
-  int inside = 0;
-  int most = 0;
-  int ran = 0;
-  // Each runs the executor from inside, so that whatever else may start does so.
-  for (int i = 0; i < 6; ++i) {
-    queue->addOperation([&executor, &inside, &most, &ran] {
-      most = std::max(most, ++inside);
-      executor.runUntilIdle();
-      --inside;
-      ++ran;
-    });
-  }
-  queue->setMaximumConcurrency(0);
-  executor.runUntilIdle();
-  EXPECT_EQ(most, 1);
-  EXPECT_EQ(ran, 6);
-}
-
-TEST(OperationQueue, RunsWhatWasAddedBeforeItsLastReferenceWent) {
-  ManualExecutor executor;
-  int ran = 0;
-  auto queue = OperationQueue::create(executor, "operations");
-  queue->addOperation([&ran] { ++ran; });
-  queue->addOperation([&ran] { ++ran; });
-  queue.reset();
-  executor.runUntilIdle();
-  EXPECT_EQ(ran, 2);
-}
-
-TEST(OperationQueue, CurrentIsTheQueueOfTheRunningOperation) {
-  ManualExecutor executor;
-  const auto queue = OperationQueue::create(executor, "operations");
-  const auto serial = SerialQueue::create(executor, "serial");
-  queue->addOperation([&queue, &serial] {
-    EXPECT_EQ(OperationQueue::current(), queue.get());
-    EXPECT_EQ(Queue::current(), nullptr);
-    serial->sync([&queue, &serial] {
-      EXPECT_EQ(OperationQueue::current(), queue.get());
-      EXPECT_EQ(Queue::current(), serial.get());
-    });
-  });
-  EXPECT_EQ(OperationQueue::current(), nullptr);
-  executor.runUntilIdle();
-  EXPECT_EQ(OperationQueue::current(), nullptr);
-}
-
 // 12: delayed tasks
 
 TEST(Queue, Promise12DelayedTaskIsSubmittedWhenTheDelayHasPassedAndNotBefore) {
@@ -782,7 +481,7 @@ TEST(OnceToken, Promise13TaskRunsTheFirstTimeOnlyAndConcurrentFirstCallersWaitFo
     OnceToken token;
     int runs = 0;
     TestCountdown meeting(4);
-    join(threads(4, [&token, &runs, &meeting](int) {
+    join(startThreads(4, [&token, &runs, &meeting](int) {
       EXPECT_TRUE(meeting.arriveAndWait());
       token.runOnce([&runs] {
         std::this_thread::yield();

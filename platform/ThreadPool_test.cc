@@ -266,6 +266,26 @@ TEST(ThreadPool, DestructorDropsWhatWaitsForItsDelay) {
   EXPECT_EQ(held.use_count(), 1);
 }
 
+TEST(ThreadPool, EndRunsWhatWasGivenAndDropsWhatComesLater) {
+  ThreadPool pool(2);
+  const auto held = std::make_shared<int>(1);
+  std::atomic<int> ran{0};
+  auto queue = SerialQueue::create(pool, "queue");
+  for (int i = 0; i < 20; ++i) pool.execute([&queue, &ran] { queue->async([&ran] { ++ran; }); });
+  pool.end();
+  EXPECT_EQ(ran, 20);
+  pool.execute([held, &ran] { ++ran; });
+  pool.executeAfter(nanoseconds(0), [held, &ran] { ++ran; });
+  pool.executeAfter(nanoseconds(1), [held, &ran] { ++ran; });
+  queue->async([held, &ran] { ++ran; });
+  EXPECT_EQ(held.use_count(), 1);
+  pool.end();
+  EXPECT_EQ(ran, 20);
+  // What has nothing before it needs no thread.
+  queue->sync([&ran] { ++ran; });
+  EXPECT_EQ(ran, 21);
+}
+
 TEST(ThreadPool, DelayedTaskNeverRunsBeforeItsTime) {
   ThreadPool pool(2);
   constexpr int count = 50;
