@@ -58,6 +58,7 @@ TEST_F(ProcessScopeTest, ConcurrentFirstCallersGetTheSameOne) {
   std::vector<std::shared_ptr<int>> got(8);
   {
     std::vector<std::jthread> threads;
+    threads.reserve(got.size());
     for (std::shared_ptr<int> &slot : got) {
       threads.emplace_back(
           [&slot, &scope, &made] { slot = scope.instance<int>([&made] { return std::make_shared<int>(++made); }); });

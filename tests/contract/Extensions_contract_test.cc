@@ -9,7 +9,6 @@ namespace {
 
 using testing::ElementsAre;
 using testing::IsEmpty;
-using testing::UnorderedElementsAre;
 
 using Records = std::vector<std::shared_ptr<ExtensionRecord>>;
 
