@@ -51,38 +51,42 @@ class Deliveries {
   };
 
   ExtensionMatchingHandler handler() {
-    return [this](std::vector<std::shared_ptr<ExtensionRecord>> records, std::optional<SXError> error) {
-      EXPECT_EQ(running_.fetch_add(1), 0) << "two calls at a time";
+    return [state = state_](std::vector<std::shared_ptr<ExtensionRecord>> records, std::optional<SXError> error) {
+      EXPECT_EQ(state->running.fetch_add(1), 0) << "two calls at a time";
       {
-        const std::lock_guard lock(mutex_);
-        deliveries_.push_back({std::move(records), std::move(error)});
+        const std::lock_guard lock(state->mutex);
+        state->deliveries.push_back({std::move(records), std::move(error)});
       }
-      changed_.notify_all();
-      running_.fetch_sub(1);
+      state->changed.notify_all();
+      state->running.fetch_sub(1);
     };
   }
 
   Delivery next() {
-    std::unique_lock lock(mutex_);
-    if (!changed_.wait_for(lock, std::chrono::seconds(60), [this] { return !deliveries_.empty(); })) {
+    std::unique_lock lock(state_->mutex);
+    if (!state_->changed.wait_for(lock, std::chrono::seconds(60), [this] { return !state_->deliveries.empty(); })) {
       ADD_FAILURE() << "nothing was delivered";
       return {};
     }
-    Delivery first = std::move(deliveries_.front());
-    deliveries_.pop_front();
+    Delivery first = std::move(state_->deliveries.front());
+    state_->deliveries.pop_front();
     return first;
   }
 
   [[nodiscard]] bool isEmpty() {
-    const std::lock_guard lock(mutex_);
-    return deliveries_.empty();
+    const std::lock_guard lock(state_->mutex);
+    return state_->deliveries.empty();
   }
 
  private:
-  std::atomic<int> running_{0};
-  std::mutex mutex_;
-  std::condition_variable changed_;
-  std::deque<Delivery> deliveries_;
+  /// The handler may still be on its way out when the test goes on.
+  struct State {
+    std::atomic<int> running{0};
+    std::mutex mutex;
+    std::condition_variable changed;
+    std::deque<Delivery> deliveries;
+  };
+  std::shared_ptr<State> state_ = std::make_shared<State>();
 };
 
 class ExtensionDiscoveryTest : public ::testing::Test {

@@ -208,14 +208,18 @@ class ExtensionHostTest : public ::testing::Test {
 
   static std::optional<SXError> failureOf(const Record &record) { return begin(record).error; }
 
-  /// As the log has it.
-  pid_t lastStartedProcess() {
+  /// The process of the extension that was started, as the log tells.
+  pid_t startedProcess() {
     const std::string beginning = "[INFO] Started process ";
-    std::string number = "0";
-    for (const std::string &line : platform_->log().texts()) {
-      if (line.starts_with(beginning)) number = line.substr(beginning.size());
+    const auto deadline = std::chrono::steady_clock::now() + 60s;
+    while (std::chrono::steady_clock::now() < deadline) {
+      for (const std::string &line : platform_->log().texts()) {
+        if (line.starts_with(beginning)) return static_cast<pid_t>(std::stol(line.substr(beginning.size())));
+      }
+      std::this_thread::yield();
     }
-    return static_cast<pid_t>(std::stol(number));
+    ADD_FAILURE() << "no process was started";
+    return 0;
   }
 
   static void waitUntilReaped(pid_t process) {
@@ -489,7 +493,7 @@ TEST_F(ExtensionHostTest, LoginThatTakesTooLongFailsAllBeginsAndEndsTheProcess) 
   const Record extension = installedRecord("never-logs-in");
   Later<Begun> first = beginLater(extension);
   Later<Begun> second = beginLater(extension);
-  ASSERT_TRUE(time_.waitForTaskIn(10s));
+  const Watched process(startedProcess());
   time_.advance(9s);
   time_.advance(1s);
   for (Later<Begun> *begun : {&first, &second}) {
@@ -497,7 +501,6 @@ TEST_F(ExtensionHostTest, LoginThatTakesTooLongFailsAllBeginsAndEndsTheProcess) 
     EXPECT_TRUE(isCode(error, HostErrorCode::loginTimedOut));
     EXPECT_THAT(error->message(), HasSubstr("did not finish its login within 10 seconds"));
   }
-  const Watched process(lastStartedProcess());
   ASSERT_TRUE(time_.waitForTaskIn(5s));
   EXPECT_TRUE(process.isRunning());
   time_.advance(5s);
@@ -683,7 +686,13 @@ TEST(ExtensionLauncherTest, ChildrenDieWithTheDaemon) {
     description.workingDirectory = "/";
     description.socket.reset(::open("/dev/null", O_RDWR | O_CLOEXEC));
     launcher->launch(std::move(description), [end = ends[1]](const Result<LaunchedProcess> &process) {
-      const pid_t child = process ? process.value().processIdentifier : -1;
+      pid_t child = -1;
+      if (process) {
+        // The pipe ends when the program runs: the kernel knows by then what the child wants of it.
+        pollfd running{process.value().execFailure.get(), POLLIN, 0};
+        ::poll(&running, 1, -1);
+        child = process.value().processIdentifier;
+      }
       static_cast<void>(!::write(end, &child, sizeof(child)));
     });
     launcher->waitUntilIdle();
