@@ -14,7 +14,7 @@ BundleDescription describedBundle(const std::string &identifier) {
   return bundle;
 }
 
-std::vector<HostKind> hostsUnderTest() { return {{"Fake", makeFakeHost}}; }
+std::vector<HostKind> hostsUnderTest() { return {{"Fake", makeFakeHost}, {"Linux", makeLinuxHost}}; }
 
 void ContractTest::runEventLoopDuring(const std::function<void()> &steps) {
   std::thread others([this, &steps] {

@@ -52,6 +52,7 @@ class Awaited {
 class ContractTest : public testing::TestWithParam<HostKind> {
  protected:
   ContractTest() : host_(GetParam().make()), scope_(std::make_unique<ProcessScope>(host_->platform())) {}
+  ~ContractTest() override { host_->shutDown(); }
 
   HostUnderTest &host() { return *host_; }
   PlatformServices &platform() { return host_->platform(); }

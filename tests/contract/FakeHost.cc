@@ -7,9 +7,9 @@ namespace {
 class FakeHost : public HostUnderTest {
  public:
   FakeHost() { platform_->files().makeDirectory(directory()); }
-  ~FakeHost() override { platform_->shutDown(); }
 
   PlatformServices &platform() override { return *platform_; }
+  void shutDown() override { platform_->shutDown(); }
 
   [[nodiscard]] std::string directory() const override { return "/tests"; }
   void makeDirectory(const std::string &path) override { platform_->files().makeDirectory(path); }

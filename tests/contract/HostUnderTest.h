@@ -34,6 +34,9 @@ class HostUnderTest {
 
   virtual PlatformServices &platform() = 0;
 
+  /// Ends all that is going on, so that nothing calls into the test any more.
+  virtual void shutDown() = 0;
+
   /// An empty directory for the test's files, as a path without links or "..".
   [[nodiscard]] virtual std::string directory() const = 0;
   virtual void makeDirectory(const std::string &path) = 0;
@@ -62,5 +65,6 @@ struct HostKind {
 std::vector<HostKind> hostsUnderTest();
 
 std::unique_ptr<HostUnderTest> makeFakeHost();
+std::unique_ptr<HostUnderTest> makeLinuxHost();
 
 }  // namespace storix::contract
