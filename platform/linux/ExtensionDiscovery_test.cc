@@ -19,7 +19,6 @@ namespace {
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
 using ::testing::IsEmpty;
-using ::testing::UnorderedElementsAre;
 
 constexpr std::chrono::milliseconds quiet{100};
 
