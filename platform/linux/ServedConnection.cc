@@ -39,7 +39,9 @@ void ServedConnection::start() {
   });
   std::unique_lock lock(mutex_);
   started_ = true;
-  watch_ = context_.loop.watch(bus_->fd(), EPOLLIN, [weak = weak_from_this()](std::uint32_t) {
+  // What the peer sent before may have been read already: then an answer waits to be written.
+  const auto events = static_cast<std::uint32_t>(bus_->wanted().events) | EPOLLHUP;
+  watch_ = context_.loop.watch(bus_->fd(), events, [weak = weak_from_this()](std::uint32_t) {
     if (const auto self = weak.lock()) self->serve();
   });
   const bool isWatched = watch_ != nullptr;
