@@ -28,32 +28,6 @@ Value &entryFor(Dictionary &dictionary, std::string_view key, Value empty) {
 
 }  // namespace
 
-AccessControlMap::StoredGrant::StoredGrant(const Grant &grant)
-    : providerLength_(grant.provider.size()), consumerLength_(grant.consumer.size()) {
-  text_.reserve(grant.provider.size() + grant.consumer.size() + grant.item.size());
-  text_.append(grant.provider).append(grant.consumer).append(grant.item);
-}
-
-AccessControlMap::Grant AccessControlMap::StoredGrant::grant() const {
-  const std::string_view text = text_;
-  return {text.substr(0, providerLength_), text.substr(providerLength_, consumerLength_),
-          text.substr(providerLength_ + consumerLength_)};
-}
-
-bool AccessControlMap::StoredGrant::is(const Grant &grant) const {
-  const Grant own = this->grant();
-  return own.item == grant.item && own.consumer == grant.consumer && own.provider == grant.provider;
-}
-
-std::size_t AccessControlMap::Hash::operator()(const Grant &grant) const {
-  constexpr std::hash<std::string_view> hash;
-  constexpr std::size_t mix = 0x9e3779b97f4a7c15U;
-  std::size_t combined = hash(grant.item);
-  combined = (combined ^ (combined >> 29U)) * mix + hash(grant.consumer);
-  combined = (combined ^ (combined >> 29U)) * mix + hash(grant.provider);
-  return combined ^ (combined >> 32U);
-}
-
 Result<AccessControlMap> AccessControlMap::fromValue(Value content) {
   Dictionary *providers = content.dictionary();
   if (!providers) return wrongShape("at the top", content, ValueKind::dictionary);
@@ -63,20 +37,22 @@ Result<AccessControlMap> AccessControlMap::fromValue(Value content) {
     const Dictionary *consumers = providerEntry.dictionary();
     if (!consumers) return wrongShape("for " + thisProvider, providerEntry, ValueKind::dictionary);
     for (const auto &[consumer, consumerEntry] : *consumers) {
+      const std::string where = "for consumer " + quoted(consumer) + " of " + thisProvider;
       const Dictionary *fields = consumerEntry.dictionary();
-      const auto where = [&] { return "for consumer " + quoted(consumer) + " of " + thisProvider; };
-      if (!fields) return wrongShape(where(), consumerEntry, ValueKind::dictionary);
+      if (!fields) return wrongShape(where, consumerEntry, ValueKind::dictionary);
       const auto allowed = fields->find(allowedItemIDsKey);
       if (allowed == fields->end()) continue;
       const List *items = allowed->second.list();
-      if (!items) return wrongShape("as AllowedItemIDs " + where(), allowed->second, ValueKind::list);
+      if (!items) return wrongShape("as AllowedItemIDs " + where, allowed->second, ValueKind::list);
+      Items &indexed = map.index_[provider][consumer];
+      indexed.reserve(items->size());
       for (std::size_t i = 0; i < items->size(); ++i) {
         const std::string *item = (*items)[i].string();
         if (!item) {
-          return wrongShape("as item " + std::to_string(i) + " of AllowedItemIDs " + where(), (*items)[i],
+          return wrongShape("as item " + std::to_string(i) + " of AllowedItemIDs " + where, (*items)[i],
                             ValueKind::string);
         }
-        map.index_.emplace(Grant{provider, consumer, *item});
+        indexed.insert(*item);
       }
     }
   }
@@ -84,12 +60,16 @@ Result<AccessControlMap> AccessControlMap::fromValue(Value content) {
   return map;
 }
 
-bool AccessControlMap::contains(std::string_view provider, std::string_view item, std::string_view consumer) const {
-  return index_.contains(Grant{provider, consumer, item});
+bool AccessControlMap::contains(const std::string &provider, const std::string &item,
+                                const std::string &consumer) const {
+  const auto consumers = index_.find(provider);
+  if (consumers == index_.end()) return false;
+  const auto items = consumers->second.find(consumer);
+  return items != consumers->second.end() && items->second.contains(item);
 }
 
 bool AccessControlMap::add(const std::string &provider, const std::string &item, const std::string &consumer) {
-  if (!index_.emplace(Grant{provider, consumer, item}).second) return false;
+  if (!index_[provider][consumer].insert(item).second) return false;
   Dictionary &consumers = *entryFor(dictionary_, provider, Dictionary()).dictionary();
   Dictionary &fields = *entryFor(consumers, consumer, Dictionary()).dictionary();
   entryFor(fields, allowedItemIDsKey, List()).list()->emplace_back(item);
@@ -97,11 +77,10 @@ bool AccessControlMap::add(const std::string &provider, const std::string &item,
 }
 
 bool AccessControlMap::remove(const std::string &provider, const std::string &item, const std::string &consumer) {
-  const auto indexed = index_.find(Grant{provider, consumer, item});
-  if (indexed == index_.end()) return false;
-  index_.erase(indexed);
+  if (!contains(provider, item, consumer)) return false;
+  index_[provider][consumer].erase(item);
 
-  // What the index holds stands in the dictionary too.
+  // What the index held stands in the dictionary too.
   const auto providerEntry = dictionary_.find(provider);
   Dictionary &consumers = *providerEntry->second.dictionary();
   const auto consumerEntry = consumers.find(consumer);

@@ -91,6 +91,15 @@ TEST(AccessControlMap, FindsEachOfManyGrants) {
   }
 }
 
+TEST(AccessControlMap, FindsTheOthersAfterARemoval) {
+  AccessControlMap map;
+  for (int i = 0; i < 100; ++i) map.add("p", "i" + std::to_string(i), "c");
+  EXPECT_TRUE(map.remove("p", "i50", "c"));
+  for (int i = 0; i < 100; ++i) EXPECT_EQ(map.contains("p", "i" + std::to_string(i), "c"), i != 50) << i;
+  EXPECT_TRUE(map.add("p", "i50", "c"));
+  EXPECT_TRUE(map.contains("p", "i50", "c"));
+}
+
 TEST(AccessControlMap, ContentOfAnotherShapeIsAnErrorThatSaysWhere) {
   EXPECT_THAT(reasonFor(List{}), HasSubstr("a list at the top where a dictionary should be"));
   EXPECT_THAT(reasonFor(Dictionary{{"p", "x"}}), HasSubstr("a string for provider “p” where a dictionary"));
