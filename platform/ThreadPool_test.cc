@@ -448,5 +448,43 @@ TEST(LocalTasks, DoNotHoldUpAnotherThreadsSyncBehindThem) {
   EXPECT_EQ(value, 2);
 }
 
+TEST(ThreadPoolEnd, RunsWhatWasGivenAndWhatThatGives) {
+  ThreadPool pool;
+  std::atomic<int> ran = 0;
+  for (int i = 0; i < 100; ++i) {
+    pool.execute([&pool, &ran] {
+      ++ran;
+      pool.execute([&ran] { ++ran; });
+    });
+  }
+  pool.end();
+  EXPECT_EQ(ran, 200);
+}
+
+TEST(ThreadPoolEnd, DropsWhatWaitsForItsDelayAndWhatComesLater) {
+  ThreadPool pool;
+  const auto held = std::make_shared<int>(0);
+  pool.executeAfter(std::chrono::hours(1), [held] { ADD_FAILURE(); });
+  pool.end();
+  pool.execute([held] { ADD_FAILURE(); });
+  pool.executeAfter(std::chrono::nanoseconds(1), [held] { ADD_FAILURE(); });
+  EXPECT_EQ(held.use_count(), 1);
+  pool.end();
+}
+
+TEST(ThreadPoolEnd, QueuesDropTheirTasksAndCanStillBeUsedAndLetGo) {
+  ThreadPool pool;
+  auto queue = SerialQueue::create(pool, "queue");
+  const auto held = std::make_shared<int>(0);
+  queue->suspend();
+  queue->async([held] { ADD_FAILURE(); });
+  pool.end();
+  queue.reset();
+  EXPECT_EQ(held.use_count(), 1);
+  int value = 0;
+  SerialQueue::create(pool, "another")->sync([&value] { value = 1; });
+  EXPECT_EQ(value, 1);
+}
+
 }  // namespace
 }  // namespace storix

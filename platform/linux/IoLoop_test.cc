@@ -184,5 +184,31 @@ TEST_F(IoLoopTest, AFileThatCannotBeWaitedForIsRefused) {
   EXPECT_EQ(loop.watch(-1, EPOLLIN, [](std::uint32_t) {}), nullptr);
 }
 
+TEST_F(IoLoopTest, EndWaitsForTheHandlerThatRunsAndLetsNoneStart) {
+  IoLoop loop(pool_);
+  const UniqueFd event = makeEvent();
+  const UniqueFd late = makeEvent();
+  std::promise<void> started;
+  std::promise<void> mayFinish;
+  std::atomic<bool> finished = false;
+  const auto watch = loop.watch(event.get(), EPOLLIN, [&](std::uint32_t) {
+    lower(event);
+    started.set_value();
+    mayFinish.get_future().wait();
+    finished = true;
+  });
+  raise(event);
+  started.get_future().wait();
+  std::thread finisher([&mayFinish] { mayFinish.set_value(); });
+  loop.end();
+  finisher.join();
+  EXPECT_TRUE(finished);
+  const auto lateWatch = loop.watch(late.get(), 0, [](std::uint32_t) { ADD_FAILURE(); });
+  ASSERT_NE(lateWatch, nullptr);
+  lateWatch->setEvents(EPOLLIN);
+  raise(late);
+  loop.end();
+}
+
 }  // namespace
 }  // namespace storix::linuxhost
