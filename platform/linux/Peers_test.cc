@@ -28,9 +28,10 @@ class PeersTest : public ::testing::Test {
     const UniqueFd client = listener_.connectToIt();
     return admitted(listener_.accept().get());
   }
-  bool isConfinedAfter(const std::function<bool()> &prepare) {
-    const TestPeerProcess process(listener_, prepare);
-    return admitted(process.connection())->isConfined();
+  bool isConfinedAfter(const std::function<bool()> &prepare, unsigned long namespaces = 0) {
+    const TestPeerProcess process(listener_, prepare, namespaces);
+    const std::shared_ptr<Peer> peer = admitted(process.connection());
+    return peer && peer->isConfined();
   }
 
   TestDirectory test_;
@@ -134,8 +135,10 @@ TEST_F(PeersTest, IdentityIsOfTheProgramAndSettledWhenTheConnectionIsAccepted) {
 
 TEST_F(PeersTest, NoNewPrivilegesConfine) { EXPECT_TRUE(isConfinedAfter(giveUpNewPrivileges)); }
 
-TEST_F(PeersTest, AnotherUserNamespaceConfines) {
-  EXPECT_TRUE(isConfinedAfter([] { return ::unshare(CLONE_NEWUSER) == 0; }));
+TEST_F(PeersTest, NamespacesOfItsOwnConfine) {
+  EXPECT_FALSE(isConfinedAfter(nullptr));
+  EXPECT_TRUE(isConfinedAfter(nullptr, CLONE_NEWUSER));
+  EXPECT_TRUE(isConfinedAfter(nullptr, CLONE_NEWUSER | CLONE_NEWNS));
 }
 
 TEST_F(PeersTest, ProcessThatCannotBeLookedAtIsNobodyAndConfined) {

@@ -5,6 +5,7 @@
 #include <poll.h>
 #include <sys/prctl.h>
 #include <sys/socket.h>
+#include <sys/syscall.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -52,12 +53,16 @@ class TestListener {
 /// A process that prepares itself, connects twice, and does nothing until the test lets it go.
 class TestPeerProcess {
  public:
-  explicit TestPeerProcess(const TestListener &listener, const std::function<bool()> &prepare = nullptr) {
+  /// `namespaces` are the flags of clone(2) for those that it gets of its own.
+  explicit TestPeerProcess(const TestListener &listener, const std::function<bool()> &prepare = nullptr,
+                           unsigned long namespaces = 0) {
     std::array<int, 2> ends{};
     EXPECT_EQ(::pipe2(ends.data(), O_CLOEXEC), 0);
     UniqueFd waiting(ends[0]);
     letGo_.reset(ends[1]);
-    process_ = ::fork();
+    process_ = namespaces == 0
+                   ? ::fork()
+                   : static_cast<pid_t>(::syscall(SYS_clone, namespaces | SIGCHLD, nullptr, nullptr, nullptr, nullptr));
     if (process_ == 0) {
       letGo_.reset();
       const bool prepared = !prepare || prepare();
