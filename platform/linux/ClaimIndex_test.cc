@@ -138,6 +138,7 @@ TEST(ClaimIndexTest, AgreesWithThePlainRuleOnRandomClaims) {
 TEST(ClaimIndexTest, ManyThousandClaimsOnOnePathAreServedOneAfterAnother) {
   ClaimIndex index;
   std::vector<ClaimIndex::Number> writers;
+  writers.reserve(20000);
   for (int i = 0; i < 20000; ++i) writers.push_back(index.add("/home/ada/groups/one/Storix Storage/file", exclusive));
   for (std::size_t i = 0; i + 1 < writers.size(); ++i) {
     ASSERT_THAT(index.remove(writers[i]), ElementsAre(writers[i + 1]));

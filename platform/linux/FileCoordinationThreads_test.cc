@@ -129,6 +129,7 @@ TEST(FileCoordinationThreads, ReadersAndWritersOfManyConnectionsExcludeEachOther
   std::atomic<int> readers = 0;
   std::atomic<int> writers = 0;
   std::vector<std::thread> threads;
+  threads.reserve(4);
   for (int thread = 0; thread < 4; ++thread) {
     threads.emplace_back([&coordination, &directory, &readers, &writers, thread] {
       for (int i = 0; i < 200; ++i) {

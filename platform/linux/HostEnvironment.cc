@@ -106,8 +106,10 @@ Result<std::string> readRuntimeDirectory(const Reader &reader) {
 /// `name` below each data directory.
 std::vector<std::string> belowDataDirectories(const std::vector<std::string> &dataDirectories, std::string_view name) {
   std::vector<std::string> directories;
-  for (const std::string &directory : dataDirectories)
+  directories.reserve(dataDirectories.size());
+  for (const std::string &directory : dataDirectories) {
     directories.push_back(directory + "/storix/" + std::string(name));
+  }
   return directories;
 }
 
