@@ -3,6 +3,9 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <csignal>
+#include <cstdio>
+
 #include "platform/fake/FakeHostTest.h"
 
 namespace storix {
@@ -135,6 +138,26 @@ TEST(LogWithoutScope, HandleIsTheSameEveryTime) { EXPECT_EQ(&sx_default_log(), &
 TEST(ProgrammingErrorDeathTest, EndsTheProcessAndSaysWhatWasWrong) {
   EXPECT_DEATH(endProcessForProgrammingError("An identifier\nis absent."),
                "storix: programming error: An identifier\\\\nis absent\\.");
+}
+
+using LogDeathTest = LogTest;
+
+fake::FakeLog *logOfEndingProcess = nullptr;
+
+void printLogOfEndingProcess(int /*signal*/) {
+  for (const LogLine &line : logOfEndingProcess->lines()) {
+    if (line.severity == LogSeverity::fault) std::fprintf(stderr, "sink: %s\n", line.text.c_str());
+  }
+}
+
+TEST_F(LogDeathTest, ProgrammingErrorReachesTheSinkBeforeTheEnd) {
+  logOfEndingProcess = &platform().log();
+  EXPECT_DEATH(
+      {
+        std::signal(SIGABRT, printLogOfEndingProcess);
+        endProcessForProgrammingError("An identifier is absent.");
+      },
+      "sink: \\[ERROR\\] Ending the process after a programming error: An identifier is absent\\.");
 }
 
 }  // namespace
