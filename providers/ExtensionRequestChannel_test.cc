@@ -6,7 +6,6 @@
 namespace storix {
 namespace {
 
-using fake::VendorAnswer;
 using ::testing::ElementsAre;
 
 /// What a handler got, one after another.
@@ -196,6 +195,7 @@ TEST(KTStorixExtensionHostContext, TheVendorProtocolHasItsOperationsInOrder) {
   const std::vector<OperationDescription> &operations = _KTStorixVendorProtocol().description().operations;
   const auto kinds = [](const std::vector<ArgumentDescription> &arguments) {
     std::vector<ValueKind> list;
+    list.reserve(arguments.size());
     for (const ArgumentDescription &argument : arguments) list.push_back(argument.kind);
     return list;
   };

@@ -6,7 +6,6 @@ namespace {
 using fake::VendorAnswer;
 using ::testing::Contains;
 using ::testing::ElementsAre;
-using ::testing::IsEmpty;
 
 constexpr const char *identify = "_identifierForItemAtURL:completion:";
 constexpr const char *start = "_startProvidingItemAtURL:completion:";

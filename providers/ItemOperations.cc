@@ -69,7 +69,7 @@ void sendProvidePlaceholder(_KTStorixVendor &vendor, std::optional<URL> url, Com
       });
 }
 
-constexpr ItemOperation<URL> providePlaceholder{
+constexpr ItemOperation<URL> providePlaceholderOperation{
     "-[SXExtensionStorix providePlaceholderForItemAtURL:completionHandler:]",
     &sendProvidePlaceholder,
     "[ERROR] Cannot provide placeholder for item at URL %@ for extension %@. Error: %@",
@@ -77,7 +77,7 @@ constexpr ItemOperation<URL> providePlaceholder{
     "[DEBUG] Successfully provided placeholder at URL %@ for extension %@.",
 };
 
-constexpr ItemOperation<URL> startProviding{
+constexpr ItemOperation<URL> startProvidingOperation{
     "-[SXExtensionStorix startProvidingItemAtURL:completionHandler:]",
     &send<&_KTStorixVendor::_startProvidingItemAtURL, URL>,
     "[ERROR] Cannot provide item at URL %@ for extension %@. Error: %@",
@@ -85,7 +85,7 @@ constexpr ItemOperation<URL> startProviding{
     "[DEBUG] Successfully provided item at URL %@ for extension %@.",
 };
 
-constexpr ItemOperation<URL> stopProviding{
+constexpr ItemOperation<URL> stopProvidingOperation{
     "-[SXExtensionStorix stopProvidingItemAtURL:completionHandler:]",
     &send<&_KTStorixVendor::_stopProvidingItemAtURL, URL>,
     "[ERROR] Cannot stop providing item at URL %@ for extension %@. Error: %@",
@@ -93,7 +93,7 @@ constexpr ItemOperation<URL> stopProviding{
     "[DEBUG] Successfully stopped providing item at URL %@ for extension %@.",
 };
 
-constexpr ItemOperation<URL, std::string> itemID{
+constexpr ItemOperation<URL, std::string> itemIDOperation{
     "-[SXExtensionStorix itemIDForURL:completionHandler:]",
     &send<&_KTStorixVendor::_identifierForItemAtURL, URL, std::string>,
     "[ERROR] Cannot get item ID for URL %@ for extension %@. Error: %@",
@@ -101,7 +101,7 @@ constexpr ItemOperation<URL, std::string> itemID{
     "[DEBUG] Successfully got item ID “%@” for URL %@ from extension %@",
 };
 
-constexpr ItemOperation<std::string, URL> itemURL{
+constexpr ItemOperation<std::string, URL> itemURLOperation{
     "-[SXExtensionStorix URLForItemID:completionHandler:]",
     &send<&_KTStorixVendor::_URLForItemIdentifier, std::string, URL>,
     "[ERROR] Cannot get URL for item ID “%@” for extension %@. Error: %@",
@@ -114,24 +114,24 @@ constexpr std::string_view itemChangedName = "-[SXExtensionStorix itemChangedAtU
 }  // namespace
 
 void SXExtensionStorix::providePlaceholderForItemAtURL(std::optional<URL> url, ErrorCompletion completionHandler) {
-  perform(providePlaceholder, shared_from_this(), std::move(url), std::move(completionHandler));
+  perform(providePlaceholderOperation, shared_from_this(), std::move(url), std::move(completionHandler));
 }
 
 void SXExtensionStorix::startProvidingItemAtURL(std::optional<URL> url, ErrorCompletion completionHandler) {
-  perform(startProviding, shared_from_this(), std::move(url), std::move(completionHandler));
+  perform(startProvidingOperation, shared_from_this(), std::move(url), std::move(completionHandler));
 }
 
 void SXExtensionStorix::stopProvidingItemAtURL(std::optional<URL> url, ErrorCompletion completionHandler) {
-  perform(stopProviding, shared_from_this(), std::move(url), std::move(completionHandler));
+  perform(stopProvidingOperation, shared_from_this(), std::move(url), std::move(completionHandler));
 }
 
 void SXExtensionStorix::itemIDForURL(std::optional<URL> url,
                                      CompletionHandler<SXError, std::string> completionHandler) {
-  perform(itemID, shared_from_this(), std::move(url), std::move(completionHandler));
+  perform(itemIDOperation, shared_from_this(), std::move(url), std::move(completionHandler));
 }
 
 void SXExtensionStorix::URLForItemID(Identifier itemID, CompletionHandler<SXError, URL> completionHandler) {
-  perform(itemURL, shared_from_this(), std::move(itemID), std::move(completionHandler));
+  perform(itemURLOperation, shared_from_this(), std::move(itemID), std::move(completionHandler));
 }
 
 // Not of the family: nobody waits for it, and it ends its request on every path.

@@ -394,6 +394,8 @@ TEST_F(ThreadedProviderRegistryTest, LookupsNeverSeeAHalfRewrittenMap) {
   runUntilIdle();
   done = true;
   for (std::thread &reader : readers) reader.join();
+  // A rewrite that waited for a reader goes on now.
+  runUntilIdle();
   EXPECT_EQ(platform().fileCoordination().providers().size(), 2U);
 }
 

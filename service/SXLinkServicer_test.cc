@@ -139,6 +139,7 @@ TEST(SXDaemonProtocol, HasItsNineOperationsInOrder) {
   const std::vector<OperationDescription> &operations = SXDaemonProtocol().description().operations;
   const auto kinds = [](const std::vector<ArgumentDescription> &arguments) {
     std::vector<ValueKind> list;
+    list.reserve(arguments.size());
     for (const ArgumentDescription &argument : arguments) list.push_back(argument.kind);
     return list;
   };
