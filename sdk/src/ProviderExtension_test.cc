@@ -254,10 +254,11 @@ TEST_F(ServedExtensionTest, ASlowDocumentDoesNotHoldUpTheOthers) {
 }
 
 TEST_F(ServedExtensionTest, ACompletionMayBeCalledLaterFromAnyThread) {
-  std::thread later;
-  extension_->onStart = [&](const URL &, ProviderExtension::Completion completion) {
-    later = std::thread([completion = std::move(completion)] { completion(std::nullopt); });
+  std::promise<ProviderExtension::Completion> taken;
+  extension_->onStart = [&taken](const URL &, ProviderExtension::Completion completion) {
+    taken.set_value(std::move(completion));
   };
+  std::thread later([&taken] { taken.get_future().get()(std::nullopt); });
   EXPECT_EQ(start(item("a")), std::nullopt);
   later.join();
 }
