@@ -121,14 +121,14 @@ void TestDaemon::accept() {
       options.peer = "a client under test";
       const bool platform = i == 2;
       if (platform) options.descriptors = wire::BusConnection::Descriptors::passed;
+      // A request may be served before `add` returns, and its test may then close all connections.
+      const std::lock_guard lock(mutex_);
       auto added = loop_.add(std::move(socket), std::move(options), [this, platform](wire::BusConnection &connection) {
         if (platform) return exportPlatform(connection);
         connection.exportObject(LinkInterface(SXDaemonProtocol().description()),
                                 std::make_shared<ProtocolExporter<SXDaemon>>(SXDaemonProtocol(), daemon));
       });
-      if (!added) continue;
-      const std::lock_guard lock(mutex_);
-      connections_.push_back(added.value());
+      if (added) connections_.push_back(added.value());
     }
   }
 }

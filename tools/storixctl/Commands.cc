@@ -126,7 +126,7 @@ Result<Printed> documentVerb(const Invocation &invocation, Client &client, const
     default: {
       const auto string = client.bookmarkableString(url);
       if (!string) return string.error();
-      if (!string.value()) return posixError(ENOENT, "looking for the provider of " + url.absoluteString());
+      if (!string.value()) return SXNotFoundErrorURL(url);
       return bookmarkableString(*string.value());
     }
   }

@@ -148,7 +148,8 @@ class Client {
 
   /// Opens what the token stands for, for reading and writing, past this process's own sandbox. The
   /// companion of a document is made when it is missing. Errors: `refused` with the name
-  /// "com.tessel.Platform.Error.InvalidToken" or ".NotAFile" (not provided yet, for instance).
+  /// "com.tessel.Platform.Error.InvalidToken", ".NotAFile" (a directory, for instance) or
+  /// ".Unavailable" (a document that is not there yet, for instance).
   void open(const Data &token, Handler<UniqueFd> handler);
   [[nodiscard]] Result<UniqueFd> open(const Data &token);
 
