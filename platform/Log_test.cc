@@ -3,7 +3,6 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include <csignal>
 #include <cstdio>
 
 #include "platform/fake/FakeHostTest.h"
@@ -142,22 +141,12 @@ TEST(ProgrammingErrorDeathTest, EndsTheProcessAndSaysWhatWasWrong) {
 
 using LogDeathTest = LogTest;
 
-fake::FakeLog *logOfEndingProcess = nullptr;
-
-void printLogOfEndingProcess(int /*signal*/) {
-  for (const LogLine &line : logOfEndingProcess->lines()) {
-    if (line.severity == LogSeverity::fault) std::fprintf(stderr, "sink: %s\n", line.text.c_str());
-  }
-}
-
 TEST_F(LogDeathTest, ProgrammingErrorReachesTheSinkBeforeTheEnd) {
-  logOfEndingProcess = &platform().log();
-  EXPECT_DEATH(
-      {
-        std::signal(SIGABRT, printLogOfEndingProcess);
-        endProcessForProgrammingError("An identifier is absent.");
-      },
-      "sink: \\[ERROR\\] Ending the process after a programming error: An identifier is absent\\.");
+  platform().log().setObserver([](const LogLine &line) {
+    if (line.severity == LogSeverity::fault) std::fprintf(stderr, "sink: %s\n", line.text.c_str());
+  });
+  EXPECT_DEATH(endProcessForProgrammingError("An identifier is absent."),
+               "sink: \\[ERROR\\] Ending the process after a programming error: An identifier is absent\\.");
 }
 
 }  // namespace

@@ -22,9 +22,20 @@ std::string_view severityName(LogSeverity severity) {
 bool FakeLog::isEnabled(LogSeverity severity) const { return enabled_[static_cast<std::size_t>(severity)]; }
 
 void FakeLog::write(LogSeverity severity, std::string_view message) {
+  LogLine line{severity, std::string(message)};
+  std::function<void(const LogLine &)> observer;
+  {
+    const std::lock_guard lock(mutex_);
+    lines_.push_back(line);
+    trace_.add("log " + std::string(severityName(severity)) + " " + line.text);
+    observer = observer_;
+  }
+  if (observer) observer(line);
+}
+
+void FakeLog::setObserver(std::function<void(const LogLine &)> observer) {
   const std::lock_guard lock(mutex_);
-  lines_.push_back({severity, std::string(message)});
-  trace_.add("log " + std::string(severityName(severity)) + " " + std::string(message));
+  observer_ = std::move(observer);
 }
 
 void FakeLog::setEnabled(LogSeverity severity, bool enabled) { enabled_[static_cast<std::size_t>(severity)] = enabled; }

@@ -2,6 +2,7 @@
 
 #include <array>
 #include <atomic>
+#include <functional>
 #include <mutex>
 #include <string>
 #include <vector>
@@ -29,6 +30,8 @@ class FakeLog : public LogSink {
   void write(LogSeverity severity, std::string_view message) override;
 
   void setEnabled(LogSeverity severity, bool enabled);
+  /// Called with each line as it is written, on the thread that writes it.
+  void setObserver(std::function<void(const LogLine &)> observer);
   [[nodiscard]] std::vector<LogLine> lines() const;
   /// The lines so far, which are then forgotten (the trace keeps them).
   std::vector<LogLine> take();
@@ -41,6 +44,7 @@ class FakeLog : public LogSink {
   std::array<std::atomic<bool>, 4> enabled_{true, true, true, true};
   mutable std::mutex mutex_;
   std::vector<LogLine> lines_;
+  std::function<void(const LogLine &)> observer_;
 };
 
 }  // namespace storix::fake
