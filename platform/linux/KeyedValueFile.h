@@ -23,7 +23,7 @@ inline constexpr std::size_t keyedValueSizeLimit = std::size_t{256} << 20;
 
 /// Text that is not keyed-value text has this code in `filesErrorDomain`; a failure to read or write
 /// it is a "posix" error.
-inline constexpr std::int64_t keyedValueFormatErrorCode = 3840;
+inline constexpr std::int64_t keyedValueFormatErrorCode = 2;
 
 /// Reads from where the descriptor stands to the end. `name` is what error texts call it.
 Result<Dictionary> readKeyedValues(int fd, std::string_view name, std::size_t sizeLimit = keyedValueSizeLimit);
