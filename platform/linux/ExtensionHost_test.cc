@@ -210,6 +210,15 @@ TEST_F(ExtensionHostTest, BundleRecordsAreFoundByIdentifier) {
   EXPECT_FALSE(host_->bundleRecordForIdentifier(std::nullopt));
 }
 
+TEST_F(ExtensionHostTest, ProcessIsKnownAsItsExtensions) {
+  const Record extension = installedRecord("answers");
+  EXPECT_FALSE(host_->isProcessOfExtension(*extension->identifier(), 0));
+  const pid_t process = processOf(extension, beginWell(extension));
+  EXPECT_TRUE(host_->isProcessOfExtension(*extension->identifier(), process));
+  EXPECT_FALSE(host_->isProcessOfExtension("org.sample.other", process));
+  EXPECT_FALSE(host_->isProcessOfExtension(*extension->identifier(), ::getpid()));
+}
+
 TEST_F(ExtensionHostTest, EndOfTheHostEndsAndReapsAllProcesses) {
   const Record extension = installedRecord("answers");
   const RequestIdentifier request = beginWell(extension);
