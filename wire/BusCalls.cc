@@ -99,14 +99,14 @@ class MethodWaiter : public Waiter {
 
 }  // namespace
 
-Task BusConnection::State::transmit(Outgoing outgoing) {
-  if (ended) return outgoing.waiter->failed(disconnected("the connection has ended"));
+Task BusConnection::State::transmit(Outgoing &outgoing) {
+  OwnedMessage message = std::move(outgoing.message);
   if (!loggedIn) {
-    unsent.push_back(std::move(outgoing));
+    unsent.push_back({std::move(message), std::move(outgoing.waiter), outgoing.expectsReply});
     return {};
   }
   std::uint64_t cookie = 0;
-  const int sent = sd_bus_send(bus.get(), outgoing.message.get(), outgoing.expectsReply ? &cookie : nullptr);
+  const int sent = sd_bus_send(bus.get(), message.get(), outgoing.expectsReply ? &cookie : nullptr);
   if (sent >= 0) {
     if (outgoing.expectsReply) waiting.emplace(cookie, std::move(outgoing.waiter));
     return {};
@@ -121,15 +121,18 @@ Task BusConnection::State::transmit(Outgoing outgoing) {
 /// Sends one call, which `append` fills with the mutex held.
 void BusConnection::sendCall(const InterfaceDescription &interface, std::size_t method, const Append &append,
                              std::unique_ptr<Waiter> waiter, bool expectsReply) {
+  Outgoing outgoing{nullptr, std::move(waiter), expectsReply};
   Task failed;
   std::function<void()> wantedChanged;
   {
     const std::lock_guard lock(state_->mutex);
     sd_bus_message *raw = nullptr;
-    const int made = sd_bus_message_new_method_call(
-        state_->bus.get(), &raw, nullptr, std::string(interface.objectPath).c_str(),
-        std::string(interface.name).c_str(), std::string(interface.methods[method].name).c_str());
-    Outgoing outgoing{OwnedMessage(raw), std::move(waiter), expectsReply};
+    const int made =
+        state_->ended ? 0
+                      : sd_bus_message_new_method_call(
+                            state_->bus.get(), &raw, nullptr, std::string(interface.objectPath).c_str(),
+                            std::string(interface.name).c_str(), std::string(interface.methods[method].name).c_str());
+    outgoing.message.reset(raw);
     std::optional<MethodFailure> refused;
     if (state_->ended) {
       refused = disconnected("the connection has ended");
@@ -138,7 +141,8 @@ void BusConnection::sendCall(const InterfaceDescription &interface, std::size_t 
     } else {
       refused = append(raw);
     }
-    failed = refused ? outgoing.waiter->failed(std::move(*refused)) : state_->transmit(std::move(outgoing));
+    failed = refused ? outgoing.waiter->failed(std::move(*refused)) : state_->transmit(outgoing);
+    outgoing.message.reset();
     if (!state_->ended && state_->hasUnwritten()) wantedChanged = state_->wantedChangedHandler;
   }
   if (wantedChanged) wantedChanged();

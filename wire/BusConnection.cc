@@ -92,7 +92,10 @@ BusConnection::Wanted BusConnection::wanted() {
   if (state_->ended) return wanted;
   const int events = sd_bus_get_events(state_->bus.get());
   wanted.events = static_cast<short>(events > 0 ? events : 0);
-  if (state_->isFull()) {
+  if (!state_->begun) {
+    // The start may have read already what the peer sent; nothing else would say so.
+    wanted.events |= POLLOUT;
+  } else if (state_->isFull()) {
     wanted.events = static_cast<short>(wanted.events & ~POLLIN);
   } else if (!state_->held.empty()) {
     // A request is here already. The socket says at once that it may be written to.
@@ -109,6 +112,7 @@ void BusConnection::process() {
   // A handler may let go of the connection.
   const std::shared_ptr<BusConnection> self = shared_from_this();
   Lock lock(state_->mutex);
+  state_->begun = true;
   while (!state_->ended && step(lock)) {
   }
 }
@@ -165,14 +169,19 @@ bool BusConnection::step(Lock &lock) {
 void BusConnection::loggedIn(Lock &lock) {
   State &state = *state_;
   state.loggedIn = true;
+  std::deque<Outgoing> unsent = std::exchange(state.unsent, {});
   std::vector<Task> failures;
-  for (Outgoing &outgoing : std::exchange(state.unsent, {})) failures.push_back(state.transmit(std::move(outgoing)));
-  const std::function<void()> ready = std::exchange(state.readyHandler, {});
+  for (Outgoing &outgoing : unsent) failures.push_back(state.transmit(outgoing));
+  std::function<void()> ready = std::exchange(state.readyHandler, {});
   lock.unlock();
   if (ready) ready();
   for (const Task &failure : failures) {
     if (failure) failure();
   }
+  // What they hold may be the last of something that asks for this connection.
+  ready = nullptr;
+  failures.clear();
+  unsent.clear();
   lock.lock();
 }
 
@@ -186,39 +195,56 @@ void BusConnection::dispatch(Lock &lock, OwnedMessage message) {
   }
 }
 
+/// All that someone else may own a part of. It goes without the mutex, since the last of something that
+/// asks for this connection may be among it.
+struct BusConnection::Remains {
+  std::vector<std::unique_ptr<Waiter>> waiters;
+  std::vector<std::shared_ptr<const BusExport>> exports;
+  ClosedHandler closed;
+  std::function<void()> ready;
+  std::function<void()> wantedChanged;
+
+  explicit Remains(State &state)
+      : exports(std::exchange(state.exports, {})),
+        closed(std::exchange(state.closedHandler, {})),
+        ready(std::exchange(state.readyHandler, {})),
+        wantedChanged(std::exchange(state.wantedChangedHandler, {})) {
+    for (auto &[cookie, waiter] : state.waiting) waiters.push_back(std::move(waiter));
+    for (Outgoing &outgoing : state.unsent) waiters.push_back(std::move(outgoing.waiter));
+    state.waiting.clear();
+    state.unsent.clear();
+    state.held.clear();
+  }
+
+  /// Tells everyone who waits, and last the owner.
+  [[nodiscard]] Task telling(const SXError &reason) const {
+    std::vector<Task> tasks;
+    tasks.reserve(waiters.size() + 1);
+    for (const auto &waiter : waiters) tasks.push_back(waiter->failed(disconnected(reason.message())));
+    if (closed) tasks.emplace_back([handler = closed, reason] { handler(reason); });
+    return [tasks = std::move(tasks)] {
+      for (const Task &task : tasks) {
+        if (task) task();
+      }
+    };
+  }
+};
+
 void BusConnection::end(Lock &lock, const SXError &reason, bool later) {
   State &state = *state_;
   if (state.ended) return;
   state.ended = true;
   shutdown(fd_, SHUT_RDWR);
   const bool isOrdinary = reason.code() == ECANCELED || (state.loggedIn && reason.code() == ECONNRESET);
-
-  std::vector<std::unique_ptr<Waiter>> waiters;
-  for (auto &[cookie, waiter] : state.waiting) waiters.push_back(std::move(waiter));
-  for (Outgoing &outgoing : state.unsent) waiters.push_back(std::move(outgoing.waiter));
-  state.waiting.clear();
-  state.unsent.clear();
-  state.held.clear();
-  const auto exports = std::exchange(state.exports, {});
-  const ClosedHandler closed = std::exchange(state.closedHandler, {});
-  const auto ready = std::exchange(state.readyHandler, {});
-  const auto wantedChanged = std::exchange(state.wantedChangedHandler, {});
-  lock.unlock();
-
-  if (!isOrdinary) sx_default_log().notice("[NOTICE] Ended the connection of %@: %@", state.options.peer, reason);
-  std::vector<Task> tasks;
-  tasks.reserve(waiters.size() + 1);
-  for (const auto &waiter : waiters) tasks.push_back(waiter->failed(disconnected(reason.message())));
-  if (closed) tasks.push_back([closed, reason] { closed(reason); });
-  const Task all = [tasks = std::move(tasks)] {
-    for (const Task &task : tasks) {
-      if (task) task();
+  {
+    const Remains remains(state);
+    lock.unlock();
+    if (!isOrdinary) sx_default_log().notice("[NOTICE] Ended the connection of %@: %@", state.options.peer, reason);
+    if (later) {
+      state.runLater(remains.telling(reason));
+    } else {
+      remains.telling(reason)();
     }
-  };
-  if (later) {
-    state.runLater(all);
-  } else {
-    all();
   }
   lock.lock();
 }

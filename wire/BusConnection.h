@@ -124,6 +124,7 @@ class BusConnection : public std::enable_shared_from_this<BusConnection> {
 
  private:
   struct State;
+  struct Remains;
   struct Remote;
   using Lock = std::unique_lock<std::mutex>;
 

@@ -40,7 +40,7 @@ class Waiter {
 struct Outgoing {
   OwnedMessage message;
   std::unique_ptr<Waiter> waiter;
-  bool expectsReply;  ///< Without, the waiter hears only that the message could not be sent.
+  bool expectsReply = false;  ///< Without, the waiter hears only that the message could not be sent.
 };
 
 /// How the messages of an exported interface are read and written. Unchanging; a request keeps its share
@@ -87,6 +87,7 @@ struct BusConnection::State {
   std::mutex mutex;
   OwnedBus bus;
   FrameLimit frames;
+  bool begun = false;
   bool loggedIn = false;
   bool ended = false;
   std::vector<std::shared_ptr<const BusExport>> exports;
@@ -119,8 +120,9 @@ struct BusConnection::State {
   }
 
   /// Sends the message, or keeps it until the login has ended. Gives what is to be run without the
-  /// mutex when it could not be sent.
-  [[nodiscard]] Task transmit(Outgoing outgoing);
+  /// mutex when it could not be sent. A waiter that has nothing more to wait for is left behind, and
+  /// goes without the mutex too.
+  [[nodiscard]] Task transmit(Outgoing &outgoing);
 
   [[nodiscard]] bool answerByItself(sd_bus_message *request, const BusTarget &target) const;
   [[nodiscard]] std::variant<BusMethod, MethodFailure> find(const BusTarget &target) const;

@@ -382,6 +382,20 @@ TEST_F(BusConnectionTest, TheObjectIsLetGoOfWhenTheConnectionEndsThoughARequestI
   request->reply({});
 }
 
+TEST_F(BusConnectionTest, ObjectThatOwnsTheRepliesToItselfIsLetGoOfToo) {
+  const std::weak_ptr<RecordingObject> weak = object_;
+  exportDaemon(object_);
+  const auto remoteObject = remote();
+  remoteObject->send(rowOf("WakeUp"), {}, toReplies());
+  remoteObject->send(rowOf("WakeUp"), {}, toReplies());
+  EXPECT_TRUE(object_->requests.take());
+  object_.reset();
+  client()->close();
+  EXPECT_TRUE(closed_.take());
+  server_->join();
+  EXPECT_TRUE(weak.expired());
+}
+
 // --- What bad input gets
 
 class BadInputTest : public BusConnectionTest {
@@ -545,6 +559,17 @@ TEST_F(BadInputTest, MessagesThatComeWithTheEndOfTheLoginAreServed) {
   EXPECT_TRUE(object_->requests.take());
   sendRaw(wakeUpBytes(3));
   EXPECT_TRUE(object_->requests.take());
+}
+
+TEST_F(BusConnectionTest, RequestThatWasThereBeforeTheConnectionIsServed) {
+  auto [ours, theirs] = makeSocketPair();
+  std::optional<PlainClient> plain(std::move(theirs));
+  BusConnection::Options options;
+  options.side = BusConnection::Side::server;
+  TestConnection late(pool_, std::move(ours), std::move(options));
+  late->exportObject(LinkInterface(daemonProtocol()), std::make_shared<AnsweringObject>(Arguments{}));
+  late.start();
+  EXPECT_NE(plain->call(plain->message(daemonPath, daemonInterface, "WakeUp")), nullptr) << plain->errorText;
 }
 
 TEST_F(BadInputTest, MessageInPiecesIsServed) {

@@ -1,0 +1,381 @@
+#include "platform/linux/NamedSockets.h"
+
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <cstring>
+
+#include "platform/linux/ApplicationManifests.h"
+#include "platform/linux/ClientListener.h"
+#include "platform/linux/TestDirectory.h"
+#include "platform/linux/TestLog.h"
+#include "platform/linux/TestPeers.h"
+#include "platform/linux/TestUser.h"
+#include "service/SXDaemon.h"
+#include "wire/TestConnection.h"
+
+namespace storix::linuxhost {
+namespace {
+
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::IsEmpty;
+using wire::OwnedMessage;
+using wire::PlainClient;
+using wire::Received;
+
+constexpr const char *daemonPath = "/com/tessel/Storix";
+constexpr const char *daemonInterface = "com.tessel.Storix.Daemon";
+
+/// Connects like a client; none when there is nobody.
+UniqueFd connectTo(const std::string &path) {
+  UniqueFd socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+  if (::connect(socket.get(), reinterpret_cast<const sockaddr *>(&address), sizeof address) != 0) socket.reset();
+  return socket;
+}
+
+/// Waits for the other side to close.
+bool isClosedByPeer(const UniqueFd &socket) {
+  pollfd waited{socket.get(), POLLIN, 0};
+  if (::poll(&waited, 1, 60'000) != 1) return false;
+  char byte = 0;
+  return ::recv(socket.get(), &byte, 1, MSG_DONTWAIT) <= 0;
+}
+
+class SocketTest : public testing::Test {
+ protected:
+  SocketTest() {
+    auto opened = RuntimeDirectory::open(test_ / "run");
+    if (!opened) ADD_FAILURE() << opened.error().message();
+    directory_ = std::move(opened.value());
+  }
+
+  std::unique_ptr<NamedSocket> openSocket(
+      const std::string &name = "com.tessel.Storix",
+      wire::BusConnection::Descriptors descriptors = wire::BusConnection::Descriptors::refused) {
+    auto opened = NamedSocket::open({pool_, loop_, peers_, limit_}, *directory_, activated_, name, descriptors);
+    if (opened) return std::move(opened.value());
+    refusal_ = opened.error().message();
+    return nullptr;
+  }
+  [[nodiscard]] std::string pathOf(const std::string &name = "com.tessel.Storix") const {
+    return directory_->path() + "/" + name;
+  }
+
+  TestDirectory test_;
+  TestLog log_;
+  std::unique_ptr<RuntimeDirectory> directory_;
+  ActivatedSockets activated_;
+  std::string refusal_;
+  ThreadPool pool_;
+  IoLoop loop_{pool_};
+  PeerTable peers_{std::make_shared<ApplicationManifests>(std::vector<std::string>())};
+  ConnectionLimit limit_{3};
+};
+
+TEST_F(SocketTest, SocketIsForItsUserAloneAndGoneAtTheEnd) {
+  const auto socket = openSocket();
+  ASSERT_TRUE(socket) << refusal_;
+  struct stat found {};
+  ASSERT_EQ(::stat(pathOf().c_str(), &found), 0);
+  EXPECT_TRUE(S_ISSOCK(found.st_mode));
+  EXPECT_EQ(found.st_mode & 0777, 0600U);
+}
+
+TEST_F(SocketTest, SocketIsGoneAtTheEnd) {
+  openSocket();
+  EXPECT_NE(::access(pathOf().c_str(), F_OK), 0);
+}
+
+TEST_F(SocketTest, StaleSocketOfADeadDaemonIsReplaced) {
+  {
+    const UniqueFd stale(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::memcpy(address.sun_path, pathOf().c_str(), pathOf().size() + 1);
+    ASSERT_EQ(::bind(stale.get(), reinterpret_cast<const sockaddr *>(&address), sizeof address), 0);
+  }
+  const auto socket = openSocket();
+  ASSERT_TRUE(socket) << refusal_;
+  EXPECT_TRUE(connectTo(pathOf()));
+}
+
+TEST_F(SocketTest, WhatIsNoSocketIsLeftInPlaceAndSaid) {
+  test_.makeFile("run/com.tessel.Storix", "somebody's text");
+  EXPECT_FALSE(openSocket());
+  EXPECT_THAT(refusal_, HasSubstr("something else is there; remove it."));
+  EXPECT_EQ(test_.contentOf("run/com.tessel.Storix"), "somebody's text");
+}
+
+TEST_F(SocketTest, DirectoryWithALongPathHasItsSocketToo) {
+  const std::string longName(150, 'd');
+  auto opened = RuntimeDirectory::open(test_ / longName);
+  ASSERT_TRUE(opened) << opened.error().message();
+  directory_ = std::move(opened.value());
+  EXPECT_TRUE(openSocket()) << refusal_;
+}
+
+TEST_F(SocketTest, SocketThatWasHandedOverIsUsedAndNotMade) {
+  UniqueFd given(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  const std::string elsewhere = test_ / "elsewhere";
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::memcpy(address.sun_path, elsewhere.c_str(), elsewhere.size() + 1);
+  ASSERT_EQ(::bind(given.get(), reinterpret_cast<const sockaddr *>(&address), sizeof address), 0);
+  ASSERT_EQ(::listen(given.get(), 8), 0);
+  activated_.emplace("com.tessel.Storix", std::move(given));
+  const auto socket = openSocket();
+  ASSERT_TRUE(socket) << refusal_;
+  EXPECT_THAT(activated_, IsEmpty());
+  EXPECT_NE(::access(pathOf().c_str(), F_OK), 0);
+  Received<std::shared_ptr<ServedConnection>> accepted;
+  socket->serve([&accepted](const auto &connection) { accepted.put(connection); });
+  const UniqueFd client = connectTo(elsewhere);
+  EXPECT_TRUE(accepted.take());
+}
+
+TEST_F(SocketTest, ConnectionsWaitUntilTheSocketIsServed) {
+  const auto socket = openSocket();
+  const UniqueFd client = connectTo(pathOf());
+  ASSERT_TRUE(client);
+  Received<pid_t> accepted;
+  socket->serve([&accepted](const std::shared_ptr<ServedConnection> &connection) {
+    accepted.put(connection->peer()->processIdentifier());
+    connection->start();
+  });
+  EXPECT_EQ(accepted.take(), ::getpid());
+}
+
+TEST_F(SocketTest, ConnectionThatNobodyStartsIsDropped) {
+  const auto socket = openSocket();
+  socket->serve([](const std::shared_ptr<ServedConnection> &) {});
+  EXPECT_TRUE(isClosedByPeer(connectTo(pathOf())));
+}
+
+TEST_F(SocketTest, ThoseBeyondTheLimitWaitForAPlace) {
+  const auto socket = openSocket();
+  Received<std::shared_ptr<ServedConnection>> accepted;
+  socket->serve([&accepted](const std::shared_ptr<ServedConnection> &connection) {
+    connection->start();
+    accepted.put(connection);
+  });
+  std::vector<UniqueFd> clients;
+  for (int i = 0; i < 4; ++i) clients.push_back(connectTo(pathOf()));
+  for (int i = 0; i < 3; ++i) EXPECT_TRUE(accepted.take());
+  EXPECT_EQ(accepted.count(), 0U);
+  clients[0].reset();
+  EXPECT_TRUE(accepted.take());
+}
+
+TEST_F(SocketTest, BothSocketsShareTheLimit) {
+  const auto first = openSocket();
+  const auto second = openSocket("com.tessel.Platform");
+  Received<std::shared_ptr<ServedConnection>> accepted;
+  const auto keep = [&accepted](const std::shared_ptr<ServedConnection> &connection) {
+    connection->start();
+    accepted.put(connection);
+  };
+  first->serve(keep);
+  second->serve(keep);
+  std::vector<UniqueFd> clients;
+  for (int i = 0; i < 3; ++i) clients.push_back(connectTo(pathOf()));
+  for (int i = 0; i < 3; ++i) EXPECT_TRUE(accepted.take());
+  const UniqueFd other = connectTo(pathOf("com.tessel.Platform"));
+  clients.clear();
+  EXPECT_TRUE(accepted.take());
+}
+
+TEST_F(SocketTest, ForeignUserIsDroppedBeforeAByteIsReadWithOneLogLine) {
+  // Only root can become somebody else to see it.
+  if (::geteuid() != 0) return;
+  UniqueFd given(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  const sa_family_t family = AF_UNIX;
+  ASSERT_EQ(::bind(given.get(), reinterpret_cast<const sockaddr *>(&family), sizeof family), 0);
+  ASSERT_EQ(::listen(given.get(), 8), 0);
+  sockaddr_un address{};
+  socklen_t length = sizeof address;
+  ASSERT_EQ(::getsockname(given.get(), reinterpret_cast<sockaddr *>(&address), &length), 0);
+  activated_.emplace("com.tessel.Storix", std::move(given));
+  const auto socket = openSocket();
+  Received<bool> accepted;
+  socket->serve([&accepted](const std::shared_ptr<ServedConnection> &) { accepted.put(true); });
+  EXPECT_TRUE(holdsWithoutRoot([&address, length] {
+    const UniqueFd client(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    return ::connect(client.get(), reinterpret_cast<const sockaddr *>(&address), length) == 0 && isClosedByPeer(client);
+  }));
+  EXPECT_EQ(accepted.count(), 0U);
+  EXPECT_THAT(log_.take(), ElementsAre(HasSubstr("Dropped a connection to com.tessel.Storix: ")));
+}
+
+TEST(ConnectionLimitTest, DescriptorsAreKeptBack) {
+  EXPECT_EQ(ConnectionLimit::connectionsFor(1U << 20), 1024U);
+  EXPECT_EQ(ConnectionLimit::connectionsFor(1024), 256U);
+  EXPECT_GE(ConnectionLimit::connectionsFor(8), 1U);
+}
+
+// --- The service of the logic
+
+/// Answers WakeUp, and tells the test of everything else.
+class Waking : public ExportedObject {
+ public:
+  void invoke(std::size_t operation, Arguments, ReplyHandler reply) override {
+    if (operation == 0 && reply) reply({});
+  }
+};
+
+class TestDelegate : public ServiceListenerDelegate {
+ public:
+  bool listener(ServiceListener &, std::shared_ptr<ClientConnection> connection) override {
+    if (isRefusing) return false;
+    connection->setExportedInterface(LinkInterface(SXDaemonProtocol().description()));
+    auto object = std::make_shared<Waking>();
+    objects.put(object);
+    connection->setExportedObject(std::move(object));
+    connections.put(connection);
+    connection->resume();
+    return true;
+  }
+  bool isRefusing = false;
+  Received<std::weak_ptr<ClientConnection>> connections;
+  Received<std::weak_ptr<Waking>> objects;
+};
+
+class ClientListenerTest : public SocketTest {
+ protected:
+  ClientListenerTest() { listener_->setDelegate(delegate_); }
+
+  std::unique_ptr<NamedSocket> socket_ = openSocket();
+  std::shared_ptr<ClientListener> listener_ = std::make_shared<ClientListener>(*socket_);
+  std::shared_ptr<TestDelegate> delegate_ = std::make_shared<TestDelegate>();
+};
+
+TEST_F(ClientListenerTest, RequestsWaitWhileTheListenerIsSuspended) {
+  PlainClient client(connectTo(pathOf()));
+  int answers = 0;
+  const auto count = [](sd_bus_message *reply, void *counter, sd_bus_error *) {
+    EXPECT_EQ(sd_bus_message_get_error(reply), nullptr);
+    ++*static_cast<int *>(counter);
+    return 0;
+  };
+  const OwnedMessage request = client.message(daemonPath, daemonInterface, "WakeUp");
+  ASSERT_GE(sd_bus_call_async(client.bus(), nullptr, request.get(), count, &answers, 60'000'000), 0);
+  while (sd_bus_process(client.bus(), nullptr) > 0) {
+  }
+  EXPECT_EQ(delegate_->connections.count(), 0U);
+  listener_->resume();
+  while (answers == 0) {
+    const int result = sd_bus_process(client.bus(), nullptr);
+    ASSERT_GE(result, 0);
+    if (result == 0) {
+      ASSERT_GE(sd_bus_wait(client.bus(), 60'000'000), 0);
+    }
+  }
+}
+
+TEST_F(ClientListenerTest, ConnectionKnowsItsPeer) {
+  listener_->resume();
+  const UniqueFd client = connectTo(pathOf());
+  const auto weak = delegate_->connections.take();
+  ASSERT_TRUE(weak);
+  const auto connection = weak->lock();
+  ASSERT_TRUE(connection);
+  EXPECT_EQ(connection->peerProcessIdentifier(), ::getpid());
+  EXPECT_NE(connection->peerAuditToken(), AuditToken());
+  EXPECT_EQ(connection->entitlementValue("com.tessel.storix.acl-read"), std::nullopt);
+}
+
+TEST_F(ClientListenerTest, ConnectionAndItsObjectLiveExactlyAsLongAsThePeerStays) {
+  listener_->resume();
+  std::optional<PlainClient> client(connectTo(pathOf()));
+  ASSERT_NE(client->call(client->message(daemonPath, daemonInterface, "WakeUp")), nullptr);
+  const auto connection = delegate_->connections.take();
+  const auto object = delegate_->objects.take();
+  ASSERT_TRUE(connection && object);
+  EXPECT_FALSE(connection->expired());
+  EXPECT_FALSE(object->expired());
+  client.reset();
+  // The places are taken again only when the first connection has gone altogether.
+  std::vector<UniqueFd> others;
+  for (int i = 0; i < 3; ++i) {
+    others.push_back(connectTo(pathOf()));
+    EXPECT_TRUE(delegate_->connections.take());
+  }
+  EXPECT_TRUE(connection->expired());
+  EXPECT_TRUE(object->expired());
+}
+
+TEST_F(ClientListenerTest, RefusedConnectionIsDropped) {
+  delegate_->isRefusing = true;
+  listener_->resume();
+  EXPECT_TRUE(isClosedByPeer(connectTo(pathOf())));
+}
+
+TEST_F(ClientListenerTest, ConnectionIsDroppedWhenTheDelegateIsGone) {
+  delegate_.reset();
+  listener_->resume();
+  EXPECT_TRUE(isClosedByPeer(connectTo(pathOf())));
+}
+
+TEST_F(ClientListenerTest, JunkLoginEndsThatConnectionAloneWithOneLogLine) {
+  listener_->resume();
+  PlainClient client(connectTo(pathOf()));
+  ASSERT_NE(client.call(client.message(daemonPath, daemonInterface, "WakeUp")), nullptr);
+  const UniqueFd junk = connectTo(pathOf());
+  ASSERT_EQ(::send(junk.get(), "GET / HTTP/1.1\r\n\r\n", 18, MSG_NOSIGNAL), 18);
+  EXPECT_TRUE(isClosedByPeer(junk));
+  EXPECT_THAT(log_.take(), ElementsAre(HasSubstr("Ended the connection of pid " + std::to_string(::getpid()) +
+                                                 ": the login failed")));
+  EXPECT_NE(client.call(client.message(daemonPath, daemonInterface, "WakeUp")), nullptr);
+}
+
+TEST_F(ClientListenerTest, FloodOfRequestsOfOneClientIsAnsweredInOrder) {
+  listener_->resume();
+  PlainClient client(connectTo(pathOf()));
+  constexpr int count = 2000;
+  std::vector<int> order;
+  struct Slot {
+    std::vector<int> *order;
+    int number;
+  };
+  std::vector<Slot> slots;
+  slots.reserve(count);
+  for (int i = 0; i < count; ++i) {
+    slots.push_back({&order, i});
+    const OwnedMessage request = client.message(daemonPath, daemonInterface, "WakeUp");
+    const auto note = [](sd_bus_message *, void *slot, sd_bus_error *) {
+      const auto *noted = static_cast<Slot *>(slot);
+      noted->order->push_back(noted->number);
+      return 0;
+    };
+    ASSERT_GE(sd_bus_call_async(client.bus(), nullptr, request.get(), note, &slots.back(), 60'000'000), 0);
+  }
+  while (order.size() < count) {
+    const int result = sd_bus_process(client.bus(), nullptr);
+    ASSERT_GE(result, 0);
+    if (result == 0) {
+      ASSERT_GE(sd_bus_wait(client.bus(), 60'000'000), 0);
+    }
+  }
+  EXPECT_TRUE(std::is_sorted(order.begin(), order.end()));
+}
+
+TEST_F(ClientListenerTest, EndOfTheSocketEndsItsConnections) {
+  listener_->resume();
+  PlainClient client(connectTo(pathOf()));
+  ASSERT_NE(client.call(client.message(daemonPath, daemonInterface, "WakeUp")), nullptr);
+  listener_.reset();
+  socket_.reset();
+  EXPECT_EQ(client.call(client.message(daemonPath, daemonInterface, "WakeUp")), nullptr);
+  EXPECT_LT(client.lastResult, 0);
+}
+
+}  // namespace
+}  // namespace storix::linuxhost
