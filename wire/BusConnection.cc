@@ -234,12 +234,12 @@ void BusConnection::end(Lock &lock, const SXError &reason, bool later) {
   State &state = *state_;
   if (state.ended) return;
   state.ended = true;
-  shutdown(fd_, SHUT_RDWR);
   const bool isOrdinary = reason.code() == ECANCELED || (state.loggedIn && reason.code() == ECONNRESET);
+  if (!isOrdinary) sx_default_log().notice("[NOTICE] Ended the connection of %@: %@", state.options.peer, reason);
+  shutdown(fd_, SHUT_RDWR);
   {
     const Remains remains(state);
     lock.unlock();
-    if (!isOrdinary) sx_default_log().notice("[NOTICE] Ended the connection of %@: %@", state.options.peer, reason);
     if (later) {
       state.runLater(remains.telling(reason));
     } else {

@@ -32,7 +32,7 @@ ServedConnection::~ServedConnection() { bus_->releaseSocket(); }
 
 void ServedConnection::start() {
   bus_->setClosedHandler([weak = weak_from_this()](const SXError &) {
-    if (const auto self = weak.lock()) self->finish();
+    if (const auto self = weak.lock()) (void)self->finish();
   });
   bus_->setWantedChangedHandler([weak = weak_from_this()] {
     if (const auto self = weak.lock()) self->follow(0);
@@ -72,26 +72,30 @@ void ServedConnection::checkDeadline() { follow(EPOLLOUT); }
 
 void ServedConnection::end() {
   bus_->close();
-  finish();
+  if (finish()) return;
+  std::unique_lock lock(mutex_);
+  isOver_.wait(lock, [this] { return over_; });
 }
 
-void ServedConnection::finish() {
+/// False when somebody else is at it, or was. The closed handler must not wait for that: it may run in
+/// the very handler that the other one waits for.
+bool ServedConnection::finish() {
   const std::shared_ptr<ServedConnection> self = shared_from_this();
-  std::unique_lock lock(mutex_);
-  if (finisher_ != std::thread::id()) {
-    if (finisher_ != std::this_thread::get_id()) isOver_.wait(lock, [this] { return over_; });
-    return;
+  std::unique_ptr<IoLoop::Watch> watch;
+  Ended ended;
+  {
+    const std::lock_guard lock(mutex_);
+    if (std::exchange(finishing_, true)) return false;
+    watch = std::move(watch_);
+    ended = std::move(ended_);
   }
-  finisher_ = std::this_thread::get_id();
-  std::unique_ptr<IoLoop::Watch> watch = std::move(watch_);
-  const Ended ended = std::move(ended_);
-  lock.unlock();
   watch.reset();
   bus_->releaseSocket();
   if (ended) ended(self);
-  lock.lock();
+  const std::lock_guard lock(mutex_);
   over_ = true;
   isOver_.notify_all();
+  return true;
 }
 
 }  // namespace storix::linuxhost

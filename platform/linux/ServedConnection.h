@@ -5,7 +5,6 @@
 #include <functional>
 #include <memory>
 #include <mutex>
-#include <thread>
 
 #include "platform/Executor.h"
 #include "platform/Result.h"
@@ -49,7 +48,8 @@ class ServedConnection : public std::enable_shared_from_this<ServedConnection> {
   void start();
   [[nodiscard]] bool isStarted() const;
 
-  /// Ends it. When this returns no handler of it runs any more, but for the one that called.
+  /// Ends it. When this returns no handler of it runs any more; so it is not for those handlers, which
+  /// close `bus()` instead.
   void end();
 
   /// Serves it now, though nothing has come: its login may have taken too long.
@@ -60,7 +60,7 @@ class ServedConnection : public std::enable_shared_from_this<ServedConnection> {
                    std::shared_ptr<wire::BusConnection> bus);
   void serve();
   void follow(std::uint32_t extraEvents);
-  void finish();
+  [[nodiscard]] bool finish();
 
   const ServingContext context_;
   const std::shared_ptr<Peer> peer_;
@@ -72,7 +72,7 @@ class ServedConnection : public std::enable_shared_from_this<ServedConnection> {
   mutable std::mutex mutex_;
   bool started_ = false;
   std::unique_ptr<IoLoop::Watch> watch_;
-  std::thread::id finisher_;
+  bool finishing_ = false;
   bool over_ = false;
   std::condition_variable isOver_;
 };
