@@ -24,6 +24,10 @@ sd_id128_t serverIdentity() {
   return identity;
 }
 
+void logEnd(const std::string &peer, const SXError &reason) {
+  sx_default_log().notice("[NOTICE] Ended the connection of %@: %@", peer, reason);
+}
+
 bool hasHungUp(int fd) {
   pollfd waited{fd, 0, 0};
   return poll(&waited, 1, 0) > 0;
@@ -43,7 +47,11 @@ Result<std::shared_ptr<BusConnection>> BusConnection::open(UniqueFd socket, Opti
   if (options.side == Side::server) result = sd_bus_set_server(raw, 1, serverIdentity());
   if (result >= 0) result = sd_bus_negotiate_fds(raw, options.descriptors == Descriptors::passed ? 1 : 0);
   if (result >= 0) result = sd_bus_start(raw);
-  if (result < 0) return busError(result, "begin the login of " + options.peer);
+  if (result < 0) {
+    SXError error = busError(result, "the login failed");
+    logEnd(options.peer, error);
+    return error;
+  }
 
   auto state = std::make_unique<State>();
   state->options = std::move(options);
@@ -235,7 +243,8 @@ void BusConnection::end(Lock &lock, const SXError &reason, bool later) {
   if (state.ended) return;
   state.ended = true;
   const bool isOrdinary = reason.code() == ECANCELED || (state.loggedIn && reason.code() == ECONNRESET);
-  if (!isOrdinary) sx_default_log().notice("[NOTICE] Ended the connection of %@: %@", state.options.peer, reason);
+  // The peer does not see the end before it is in the log.
+  if (!isOrdinary) logEnd(state.options.peer, reason);
   shutdown(fd_, SHUT_RDWR);
   {
     const Remains remains(state);

@@ -74,7 +74,7 @@ class BusConnection : public std::enable_shared_from_this<BusConnection> {
   using MethodHandler = std::function<void(MethodValues, Reply)>;
 
   /// Starts the login, which `process` goes on with. An error when it fails at once: the peer is gone,
-  /// or what it sent already is no login. The socket is closed then.
+  /// or what it sent already is no login. That is logged then, and the socket closed.
   static Result<std::shared_ptr<BusConnection>> open(UniqueFd socket, Options options);
   ~BusConnection();
   BusConnection(const BusConnection &) = delete;

@@ -145,13 +145,9 @@ void NamedSocket::State::add(UniqueFd connection, ConnectionLimit::Place place) 
     sx_default_log().notice("[NOTICE] Dropped a connection to %@: %@", name, peer.error());
     return;
   }
-  const std::int32_t process = peer.value()->processIdentifier();
   auto opened =
       ServedConnection::open(context, std::move(connection), std::move(peer.value()), descriptors, std::move(place));
-  if (!opened) {
-    sx_default_log().notice("[NOTICE] Dropped a connection of pid %d to %@: %@", process, name, opened.error());
-    return;
-  }
+  if (!opened) return;
   const std::shared_ptr<ServedConnection> &served = opened.value();
   served->setEnded([weak = weak_from_this()](const std::shared_ptr<ServedConnection> &over) {
     const auto self = weak.lock();
