@@ -328,11 +328,24 @@ TEST_F(ClientListenerTest, JunkLoginEndsThatConnectionAloneWithOneLogLine) {
   listener_->resume();
   PlainClient client(connectTo(pathOf()));
   ASSERT_NE(client.call(client.message(daemonPath, daemonInterface, "WakeUp")), nullptr);
+  EXPECT_TRUE(delegate_->connections.take());
   const UniqueFd junk = connectTo(pathOf());
+  EXPECT_TRUE(delegate_->connections.take());
   ASSERT_EQ(::send(junk.get(), "GET / HTTP/1.1\r\n\r\n", 18, MSG_NOSIGNAL), 18);
   EXPECT_TRUE(isClosedByPeer(junk));
   EXPECT_THAT(log_.take(), ElementsAre(HasSubstr("Ended the connection of pid " + std::to_string(::getpid()))));
   EXPECT_NE(client.call(client.message(daemonPath, daemonInterface, "WakeUp")), nullptr);
+}
+
+TEST_F(ClientListenerTest, JunkThatWasThereBeforeTheListenerEndsThatConnectionAloneWithOneLogLine) {
+  const UniqueFd junk = connectTo(pathOf());
+  ASSERT_EQ(::send(junk.get(), "GET / HTTP/1.1\r\n\r\n", 18, MSG_NOSIGNAL), 18);
+  listener_->resume();
+  EXPECT_TRUE(isClosedByPeer(junk));
+  PlainClient client(connectTo(pathOf()));
+  EXPECT_NE(client.call(client.message(daemonPath, daemonInterface, "WakeUp")), nullptr);
+  socket_.reset();
+  EXPECT_THAT(log_.take(), ElementsAre(HasSubstr("Ended the connection of pid " + std::to_string(::getpid()))));
 }
 
 TEST_F(ClientListenerTest, FloodOfRequestsOfOneClientIsAnsweredInOrder) {
