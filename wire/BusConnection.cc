@@ -230,6 +230,7 @@ struct BusConnection::Remains {
     tasks.reserve(waiters.size() + 1);
     for (const auto &waiter : waiters) tasks.push_back(waiter->failed(disconnected(reason.message())));
     if (closed) tasks.emplace_back([handler = closed, reason] { handler(reason); });
+    if (tasks.empty()) return {};
     return [tasks = std::move(tasks)] {
       for (const Task &task : tasks) {
         if (task) task();
@@ -252,7 +253,7 @@ void BusConnection::end(Lock &lock, const SXError &reason, bool later) {
     if (later) {
       state.runLater(remains.telling(reason));
     } else {
-      remains.telling(reason)();
+      if (const Task tell = remains.telling(reason)) tell();
     }
   }
   lock.lock();

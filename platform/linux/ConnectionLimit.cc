@@ -3,6 +3,7 @@
 #include <sys/resource.h>
 
 #include <algorithm>
+#include <utility>
 
 #include "platform/linux/Sandbox.h"
 
@@ -35,22 +36,27 @@ std::size_t ConnectionLimit::connectionsForThisProcess() {
   return connectionsFor(static_cast<std::size_t>(std::min(limit.rlim_cur, wanted)));
 }
 
-std::optional<ConnectionLimit::Place> ConnectionLimit::take(std::function<void()> whenFree) {
-  const std::lock_guard lock(mutex_);
-  if (free_ == 0) {
-    waiting_.push_back(std::move(whenFree));
-    return std::nullopt;
-  }
-  --free_;
-  return Place(this);
+ConnectionLimit::ConnectionLimit(std::size_t connections) : state_(std::make_shared<State>()) {
+  state_->free = connections;
 }
 
-void ConnectionLimit::release() {
+std::optional<ConnectionLimit::Place> ConnectionLimit::take(std::function<void()> whenFree) {
+  const std::lock_guard lock(state_->mutex);
+  if (state_->free == 0) {
+    state_->waiting.push_back(std::move(whenFree));
+    return std::nullopt;
+  }
+  --state_->free;
+  return Place(state_);
+}
+
+ConnectionLimit::Place::~Place() {
+  if (!limit_) return;
   std::vector<std::function<void()>> waiting;
   {
-    const std::lock_guard lock(mutex_);
-    ++free_;
-    waiting = std::exchange(waiting_, {});
+    const std::lock_guard lock(limit_->mutex);
+    ++limit_->free;
+    waiting = std::exchange(limit_->waiting, {});
   }
   for (const auto &whenFree : waiting) whenFree();
 }

@@ -2,6 +2,7 @@
 
 #include <cstddef>
 #include <functional>
+#include <memory>
 #include <mutex>
 #include <optional>
 #include <utility>
@@ -10,9 +11,11 @@
 namespace storix::linuxhost {
 
 /// How many connections all sockets together may have, so that a flood of them leaves the daemon the
-/// file descriptors that it needs for itself. Owned by the platform object; outlives its places.
+/// file descriptors that it needs for itself. Owned by the platform object; places may outlive it.
 /// Thread-safe.
 class ConnectionLimit {
+  struct State;
+
  public:
   static constexpr std::size_t mostConnections = 1024;
 
@@ -22,21 +25,19 @@ class ConnectionLimit {
   /// The same for that many descriptors.
   static std::size_t connectionsFor(std::size_t descriptors);
 
-  explicit ConnectionLimit(std::size_t connections) : free_(connections) {}
+  explicit ConnectionLimit(std::size_t connections);
 
   /// One connection's place, free again when this is destroyed.
   class Place {
    public:
-    Place(Place &&other) noexcept : limit_(std::exchange(other.limit_, nullptr)) {}
+    Place(Place &&other) noexcept = default;
     Place &operator=(Place &&) = delete;
-    ~Place() {
-      if (limit_) limit_->release();
-    }
+    ~Place();
 
    private:
     friend class ConnectionLimit;
-    explicit Place(ConnectionLimit *limit) : limit_(limit) {}
-    ConnectionLimit *limit_;
+    explicit Place(std::shared_ptr<State> limit) : limit_(std::move(limit)) {}
+    std::shared_ptr<State> limit_;
   };
 
   /// A place; or, when there is none, none, and `whenFree` is called once, on any thread, when there
@@ -44,11 +45,12 @@ class ConnectionLimit {
   std::optional<Place> take(std::function<void()> whenFree);
 
  private:
-  void release();
-
-  std::mutex mutex_;
-  std::size_t free_;
-  std::vector<std::function<void()>> waiting_;
+  struct State {
+    std::mutex mutex;
+    std::size_t free = 0;
+    std::vector<std::function<void()>> waiting;
+  };
+  std::shared_ptr<State> state_;
 };
 
 }  // namespace storix::linuxhost
