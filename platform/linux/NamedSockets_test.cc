@@ -3,12 +3,15 @@
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <cstring>
+#include <thread>
 
 #include "platform/linux/ApplicationManifests.h"
 #include "platform/linux/ClientListener.h"
@@ -191,6 +194,29 @@ TEST_F(SocketTest, BothSocketsShareTheLimit) {
   const UniqueFd other = connectTo(pathOf("com.tessel.Platform"));
   clients.clear();
   EXPECT_TRUE(accepted.take());
+}
+
+TEST_F(SocketTest, ConnectionsWaitWhileNoDescriptorIsLeftWithOneLogLine) {
+  const auto socket = openSocket();
+  const UniqueFd client = connectTo(pathOf());
+  rlimit before{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &before), 0);
+  rlimit none = before;
+  none.rlim_cur = 0;
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &none), 0);
+  Received<std::shared_ptr<ServedConnection>> accepted;
+  socket->serve([&accepted](const auto &connection) { accepted.put(connection); });
+  std::vector<std::string> lines;
+  const auto deadline = std::chrono::steady_clock::now() + wire::generousDeadline;
+  while (lines.empty() && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::yield();
+    lines = log_.take();
+  }
+  EXPECT_THAT(lines, ElementsAre(HasSubstr("[ERROR] Connections to com.tessel.Storix have to wait: ")));
+  EXPECT_EQ(accepted.count(), 0U);
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &before), 0);
+  EXPECT_TRUE(accepted.take());
+  EXPECT_THAT(log_.take(), IsEmpty());
 }
 
 TEST_F(SocketTest, ForeignUserIsDroppedBeforeAByteIsReadWithOneLogLine) {
