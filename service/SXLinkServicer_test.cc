@@ -23,22 +23,6 @@ class SXLinkServicerTest : public ServicerTest {
   }
 };
 
-TEST_F(SXLinkServicerTest, WakeUpIsServedAndAnsweredOnTheGlobalQueue) {
-  connect({});
-  call(SXDaemon::wakeUpName);
-  EXPECT_THAT(trace(),
-              ElementsAre("request peer 100 wakeUpCompletion: ()",
-                          "log debug [DEBUG] Serving: wakeUpCompletion:", reply(SXDaemon::wakeUpName, "()", global)));
-}
-
-TEST_F(SXLinkServicerTest, WakeUpWithoutReplyDoesNothingMore) {
-  connect({});
-  client_->callWithoutReply(SXDaemon::wakeUpName);
-  runUntilIdle();
-  EXPECT_THAT(trace(), ElementsAre("request without reply peer 100 wakeUpCompletion: ()",
-                                   "log debug [DEBUG] Serving: wakeUpCompletion:"));
-}
-
 TEST_F(SXLinkServicerTest, ATrueNumberOrBooleanAdmits) {
   EXPECT_TRUE(admits({{readEntitlement, true}}));
   EXPECT_TRUE(admits({{writeEntitlement, 1}}));

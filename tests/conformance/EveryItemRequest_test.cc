@@ -1,4 +1,4 @@
-#include "service/ServicerTest.h"
+#include "tests/conformance/ItemRequestTest.h"
 
 namespace storix {
 namespace {
@@ -8,75 +8,11 @@ using ::testing::ElementsAreArray;
 
 constexpr const char *identify = "IdentifierForItemAtURL";
 
-/// One of the three requests, and what is its own.
-struct Request {
-  const char *label;
-  std::string_view name;
-  std::string operation;     // of the provider object
-  std::string message;       // to the extension
-  std::string successLine;   // of the provider object, up to the URL
-  std::string failureLine;   // of the provider object, up to the URL
-  std::string earlyFailure;  // up to the URL
-  bool looksUpByURL;
-};
-
-class ItemRequestsTest : public ServicerTest {
- protected:
-  void SetUp() override {
-    ServicerTest::SetUp();
-    connect({{readEntitlement, true}});
-  }
-
-  static constexpr const char *admitted = "entitlementValue peer 100 com.tessel.storix.acl-read";
-
-  [[nodiscard]] std::vector<std::string> ownerFound() const {
-    return {compared("org.a", *item_), "log info [INFO] Resolved URL to provider org.a."};
-  }
-
-  void expectEarlyFailure(const Request &request, const Arguments &given, const std::vector<std::string> &lookup,
-                          const SXError &error) {
-    call(request.name, given);
-    const auto argument = [&given](std::size_t i) { return logDescription(given[i]); };
-    EXPECT_THAT(trace(), ElementsAreArray(
-                             joined({served(request.name, given),
-                                     {admitted},
-                                     lookup,
-                                     {"log fault " + request.earlyFailure + " " + argument(0) + " from provider ID " +
-                                          argument(1) + " to consumer ID " + argument(2) + ". Error: " + text(error),
-                                      reply(request.name, "(" + text(error) + ")", global)}})));
-  }
-};
-
-const Request placeholder{"placeholder",
-                          SXDaemon::providePlaceholderName,
-                          "providePlaceholderForItemAtURL:completionHandler:",
-                          "_providePlaceholderAtURL:completion:",
-                          "[DEBUG] Successfully provided placeholder at URL ",
-                          "[ERROR] Proxy failed to provide placeholder at URL ",
-                          "[ERROR] Could not provide placeholder for URL",
-                          false};
-const Request start{"start",
-                    SXDaemon::startProvidingName,
-                    "startProvidingItemAtURL:completionHandler:",
-                    "_startProvidingItemAtURL:completion:",
-                    "[DEBUG] Successfully provided item at URL ",
-                    "[ERROR] Proxy failed to start providing item at URL ",
-                    "[ERROR] Cannot provide item at URL",
-                    true};
-const Request stop{"stop",
-                   SXDaemon::stopProvidingName,
-                   "stopProvidingItemAtURL:completionHandler:",
-                   "_stopProvidingItemAtURL:completion:",
-                   "[DEBUG] Successfully stopped providing item at URL ",
-                   "[ERROR] Proxy failed to stop providing item at URL ",
-                   "[ERROR] Could not stop providing item at URL",
-                   true};
-
-const auto labelOf = [](const ::testing::TestParamInfo<Request> &request) { return request.param.label; };
+const auto labelOf = [](const ::testing::TestParamInfo<ItemRequestCase> &request) { return request.param.label; };
 
 // --- What all three share
 
-class EveryItemRequestTest : public ItemRequestsTest, public ::testing::WithParamInterface<Request> {};
+class EveryItemRequestTest : public ItemRequestsTest, public ::testing::WithParamInterface<ItemRequestCase> {};
 INSTANTIATE_TEST_SUITE_P(Requests, EveryItemRequestTest, ::testing::Values(placeholder, start, stop), labelOf);
 
 TEST_P(EveryItemRequestTest, AClientWithoutEntitlementIsRefused) {
@@ -152,7 +88,7 @@ TEST_P(EveryItemRequestTest, AnAnswerAfterTheClientIsGoneHarmsNobody) {
 
 // --- What placeholder and start share
 
-class GrantedItemRequestTest : public ItemRequestsTest, public ::testing::WithParamInterface<Request> {
+class GrantedItemRequestTest : public ItemRequestsTest, public ::testing::WithParamInterface<ItemRequestCase> {
  protected:
   [[nodiscard]] std::vector<std::string> lookup() const {
     return GetParam().looksUpByURL ? ownerFound() : std::vector<std::string>();
@@ -238,67 +174,6 @@ TEST_P(GrantedItemRequestTest, ALateConnectionFailureRepliesAgain) {
   process("org.a").setAnswer(GetParam().message,
                              VendorAnswer::valuesThenConnectionFailure({}, someError("the process ended")));
   EXPECT_EQ(call(GetParam().name, arguments(item_, "org.a", "org.app"))->answers().size(), 2U);
-}
-
-// --- What each has for itself
-
-TEST_F(ItemRequestsTest, APlaceholderIsAskedOfTheNamedProviderWhoeverOwnsTheURL) {
-  const SXError error = someError("not mine");
-  process("org.b").setAnswer(identify, VendorAnswer::values({Argument(error), Argument()}));
-  const std::shared_ptr<fake::FakeReply> answered = call(placeholder.name, arguments(item_, "org.b", "org.app"));
-  EXPECT_EQ(answered->error(0), SXPluginOperationFailedError(SXPluginOperationFailedError(error)));
-  EXPECT_EQ(platform().trace().count("directoryRelationship"), 0U);
-}
-
-TEST_F(ItemRequestsTest, StartNamesTheIdentifierThatDoesNotFitTheOwner) {
-  expectEarlyFailure(start, arguments(item_, "org.b", "org.app"), ownerFound(),
-                     SXInvalidParameterError("providerID", "org.b"));
-  expectEarlyFailure(start, arguments(item_, "ORG.A", "org.app"), ownerFound(),
-                     SXInvalidParameterError("providerID", "ORG.A"));
-}
-
-TEST_F(ItemRequestsTest, StopDoesNotNameTheIdentifierThatDoesNotFitTheOwner) {
-  expectEarlyFailure(stop, arguments(item_, "org.b", "org.app"), ownerFound(),
-                     SXInvalidParameterError("providerID", std::nullopt));
-}
-
-TEST_F(ItemRequestsTest, AProvidersDirectoryItselfHasNoOwner) {
-  const std::optional<URL> directory = storageURL("org.a");
-  const std::vector<std::string> lookup{
-      compared("org.a", *directory),
-      "log debug [DEBUG] Ignoring URLs that exactly match the document container folder"};
-  expectEarlyFailure(start, arguments(directory, "org.a", "org.app"), lookup, SXNotFoundError("org.a"));
-  expectEarlyFailure(stop, arguments(directory, "org.a", "org.app"), lookup, SXNotFoundError("org.a"));
-}
-
-TEST_F(ItemRequestsTest, StopIsForwardedWithoutAGrantAndAlwaysAnswersWithAnError) {
-  const Arguments given = arguments(item_, "org.a", "org.app");
-  call(stop.name, given);
-  EXPECT_THAT(trace(),
-              ElementsAreArray(joined(
-                  {served(stop.name, given),
-                   {admitted},
-                   ownerFound(),
-                   message(stop.operation, "org.a", "request-3", stop.message, itemText(), "()"),
-                   {"log debug " + stop.successLine + itemText() + " for extension org.a.",
-                    reply(stop.name, "(" + text(SXPluginOperationFailedError(std::nullopt)) + ")", platformThread),
-                    cancel("org.a", "request-3")}})));
-}
-
-TEST_F(ItemRequestsTest, AFailedStopIsLoggedAndWrapped) {
-  const SXError error = someError("busy");
-  process("org.a").setAnswer(stop.message, VendorAnswer::values({Argument(error)}));
-  const std::shared_ptr<fake::FakeReply> answered = call(stop.name, arguments(item_, "org.a", "org.app"));
-  const SXError wrapped = SXPluginOperationFailedError(error);
-  EXPECT_EQ(answered->error(0), SXPluginOperationFailedError(wrapped));
-  EXPECT_EQ(answered->answer().context, platformThread);
-  const std::vector<std::string> lines = trace();
-  ASSERT_GE(lines.size(), 4U);
-  EXPECT_EQ(lines[lines.size() - 4],
-            "log fault " + stop.failureLine + itemText() + " for extension org.a. Error: " + text(error));
-  EXPECT_EQ(lines[lines.size() - 3],
-            "log fault [ERROR] Could not ask provider ID org.a to stop providing item at URL " + itemText() +
-                ". Error: " + text(wrapped));
 }
 
 }  // namespace

@@ -1,0 +1,90 @@
+#include "service/ServicerTest.h"
+
+namespace storix {
+namespace {
+
+using fake::VendorAnswer;
+using ::testing::ElementsAreArray;
+
+constexpr const char *identify = "IdentifierForItemAtURL";
+
+class BookmarkableStringRequestTest : public ServicerTest {
+ protected:
+  static constexpr std::string_view name = SXDaemon::bookmarkableStringName;
+
+  void SetUp() override {
+    ServicerTest::SetUp();
+    connect({});
+  }
+
+  static Arguments request(const std::optional<URL> &url) { return packArguments<URL>(url); }
+
+  /// The first lines, which check nothing.
+  [[nodiscard]] std::vector<std::string> start(const std::optional<URL> &url) const {
+    return {"request peer 100 " + std::string(name) + " (" + logDescription(url) + ")",
+            "log debug [DEBUG] Getting bookmarkable string for URL " + logDescription(url)};
+  }
+};
+
+TEST_F(BookmarkableStringRequestTest, AnyClientGetsTheStringOfAnItem) {
+  call(name, request(item_));
+  EXPECT_THAT(trace(),
+              ElementsAreArray(
+                  joined({start(item_),
+                          {compared("org.a", *item_), "log info [INFO] Resolved URL to provider org.a."},
+                          identification("org.a", "request-3", *item_),
+                          {"log debug [DEBUG] Successfully generated bookmarkable string "
+                           "“storix:org.a/f/i” from URL " +
+                               itemText() + ".",
+                           reply(name, "(storix:org.a/f/i, (null))", platformThread), cancel("org.a", "request-3")}})));
+  EXPECT_FALSE(platform().files().exists("/home/u/Library/Storix/AccessControl.kvs"));
+}
+
+TEST_F(BookmarkableStringRequestTest, AURLOutsideEveryProviderGetsNeitherStringNorError) {
+  const std::optional<URL> url = URL::fromString("file:///elsewhere");
+  call(name, request(url));
+  EXPECT_THAT(trace(),
+              ElementsAreArray(joined({start(url),
+                                       {compared("org.a", *url), compared("org.b", *url),
+                                        "log info [INFO] Could not find the provider for URL file:///elsewhere",
+                                        reply(name, "((null), (null))", global)}})));
+}
+
+TEST_F(BookmarkableStringRequestTest, AnAbsentURLIsNobodys) {
+  const std::shared_ptr<fake::FakeReply> answered = call(name, request(std::nullopt));
+  EXPECT_EQ(answered->answer().values, (Arguments{Argument(), Argument()}));
+  EXPECT_TRUE(platform().log().contains(LogSeverity::info, "[INFO] Could not find the provider for URL (null)"));
+}
+
+TEST_F(BookmarkableStringRequestTest, TheProviderObjectsErrorIsPassedOnUnchanged) {
+  const SXError error = someError("no such item");
+  process("org.a").setAnswer(identify, VendorAnswer::values({Argument(error), Argument("f/i")}));
+  call(name, request(item_));
+  EXPECT_EQ(platform().trace().count(
+                reply(name, "((null), " + text(SXPluginOperationFailedError(error)) + ")", platformThread)),
+            1U);
+  EXPECT_EQ(platform().trace().count("log fault"), 1U);
+}
+
+TEST_F(BookmarkableStringRequestTest, NeitherIdentifierNorErrorIsAnErrorLineAndAnEmptyReply) {
+  process("org.a").setAnswer(identify, VendorAnswer::values());
+  call(name, request(item_));
+  EXPECT_TRUE(
+      platform().log().contains(LogSeverity::fault, "[ERROR] Could not get Item ID for URL " + itemText() + "."));
+  EXPECT_EQ(platform().trace().count(reply(name, "((null), (null))", platformThread)), 1U);
+}
+
+TEST_F(BookmarkableStringRequestTest, NeedsNoReplyHandler) {
+  client_->callWithoutReply(name, request(item_));
+  client_->callWithoutReply(name, request(URL::fromString("file:///elsewhere")));
+  runUntilIdle();
+  process("org.a").setAnswer(identify, VendorAnswer::values());
+  client_->callWithoutReply(name, request(item_));
+  process("org.a").setBeginFailure(someError("no process"));
+  client_->callWithoutReply(name, request(item_));
+  runUntilIdle();
+  EXPECT_EQ(platform().trace().count("reply"), 0U);
+}
+
+}  // namespace
+}  // namespace storix

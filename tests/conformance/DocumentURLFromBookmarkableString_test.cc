@@ -1,0 +1,145 @@
+#include "service/ServicerTest.h"
+
+namespace storix {
+namespace {
+
+using fake::VendorAnswer;
+using ::testing::ElementsAreArray;
+
+constexpr const char *locate = "URLForItemIdentifier";
+
+class DocumentURLRequestTest : public ServicerTest {
+ protected:
+  static constexpr std::string_view name = SXDaemon::documentURLName;
+
+  void SetUp() override {
+    ServicerTest::SetUp();
+    process("org.a").setAnswer(locate, VendorAnswer::values({Argument(), Argument(*item_)}));
+    connect({}, "org.app");
+  }
+
+  static Arguments request(const Text &string) { return packArguments<std::string>(string); }
+
+  [[nodiscard]] std::vector<std::string> start(const std::string &string) const {
+    return {"request peer 100 " + std::string(name) + " (" + string + ")",
+            "log debug [DEBUG] Getting URL from bookmarkable string: “" + string + "”.", "peerAuditToken peer 100",
+            "bundleIdentifierForAuditToken peer 100"};
+  }
+  static std::string failed(const SXError &error, const char *where) {
+    return reply(name, "((null), (null), (null), (null), " + text(error) + ")", where);
+  }
+};
+
+TEST_F(DocumentURLRequestTest, AGrantedItemIsLocatedAndGetsTokens) {
+  grant("org.a", "f/i", "org.app");
+  call(name, request("storix:org.a/f/i"));
+  const URL companion = itemURL("org.a", ".report.txt");
+  EXPECT_THAT(
+      trace(),
+      ElementsAreArray(joined(
+          {start("storix:org.a/f/i"),
+           message("URLForItemID:completionHandler:", "org.a", "request-3", "_URLForItemIdentifier:completion:", "f/i",
+                   "((null), " + itemText() + ")"),
+           {"log debug [DEBUG] Successfully retrieved URL " + itemText() + " for item ID “f/i” from extension org.a",
+            "issueSandboxExtension readWrite " + item_->path() + " flags=0",
+            "issueSandboxExtension readWrite " + companion.path() + " flags=0",
+            "log info [INFO] Successfully extended sandbox of URL " + itemText() +
+                " from provider ID org.a to consumer ID org.app.",
+            reply(name,
+                  "(" + itemText() + ", " + token(*item_) + ", " + companion.absoluteString() + ", " +
+                      token(companion) + ", (null))",
+                  platformThread),
+            cancel("org.a", "request-3")}})));
+}
+
+TEST_F(DocumentURLRequestTest, ACallerWithoutBundleIsNotPermittedWhateverTheString) {
+  connect({{writeEntitlement, true}});
+  for (const char *string : {"storix:org.a/f/i", "nonsense"}) {
+    call(name, request(string));
+    EXPECT_THAT(trace(), ElementsAreArray(joined({start(string), {failed(SXNotPermittedError(), global)}})));
+  }
+}
+
+TEST_F(DocumentURLRequestTest, AMalformedStringIsInvalid) {
+  for (const char *string : {"storix:org.sample.docs//a", "storix:/a", "storix:org.sample.docs",
+                             " storix:org.sample.docs/a", "Storix:org.sample.docs/a", ""}) {
+    call(name, request(string));
+    EXPECT_THAT(trace(),
+                ElementsAreArray(joined({start(string), {failed(SXInvalidBookmarkableStringError(), global)}})));
+  }
+}
+
+TEST_F(DocumentURLRequestTest, AnAbsentStringIsInvalid) {
+  EXPECT_EQ(call(name, request(std::nullopt))->error(4), SXInvalidBookmarkableStringError());
+  EXPECT_TRUE(platform().log().contains(LogSeverity::debug, "[DEBUG] Getting URL from bookmarkable string: “(null)”."));
+}
+
+TEST_F(DocumentURLRequestTest, WithoutAGrantToTheCallerItIsNotPermitted) {
+  grant("org.a", "f/i", "org.other");
+  grant("org.a", "f", "org.app");
+  call(name, request("storix:org.a/f/i"));
+  EXPECT_THAT(trace(), ElementsAreArray(joined(
+                           {start("storix:org.a/f/i"),
+                            {"log fault [ERROR] Provider ID org.a is not allowed to provide item ID “f/i” to consumer "
+                             "ID org.app",
+                             failed(SXNotPermittedError(), global)}})));
+}
+
+TEST_F(DocumentURLRequestTest, TheItemKeepsItsSlashes) {
+  grant("org.a", "a/b/c", "org.app");
+  grant("org.a", "a/", "org.app");
+  call(name, request("storix:org.a/a/b/c"));
+  EXPECT_EQ(platform().trace().count("send request-3 _URLForItemIdentifier:completion: (a/b/c)"), 1U);
+  call(name, request("storix:org.a/a/"));
+  EXPECT_EQ(platform().trace().count("send request-4 _URLForItemIdentifier:completion: (a/)"), 1U);
+}
+
+TEST_F(DocumentURLRequestTest, AProviderThatIsNotThereIsNeverAnswered) {
+  grant("org.none", "i", "org.app");
+  const std::shared_ptr<fake::FakeReply> answered = call(name, request("storix:org.none/i"));
+  EXPECT_THAT(trace(), ElementsAreArray(start("storix:org.none/i")));
+  EXPECT_FALSE(answered->isAnswered());
+}
+
+TEST_F(DocumentURLRequestTest, AProviderThatCannotLocateTheItemIsASandboxFailure) {
+  grant("org.a", "f/i", "org.app");
+  process("org.a").setAnswer(locate, VendorAnswer::values({Argument(someError("gone")), Argument(*item_)}));
+  call(name, request("storix:org.a/f/i"));
+  EXPECT_EQ(platform().trace().count(failed(SXSandboxExtensionFailedError(std::nullopt), platformThread)), 1U);
+  EXPECT_EQ(platform().trace().count("issueSandboxExtension"), 0U);
+}
+
+TEST_F(DocumentURLRequestTest, AProviderThatGivesNoURLIsASuccessWithNothing) {
+  grant("org.a", "f/i", "org.app");
+  process("org.a").setAnswer(locate, VendorAnswer::values());
+  EXPECT_EQ(call(name, request("storix:org.a/f/i"))->answer().values, Arguments(5));
+  EXPECT_TRUE(platform().log().contains(LogSeverity::info,
+                                        "[INFO] Successfully extended sandbox of URL (null) from "
+                                        "provider ID org.a to consumer ID org.app."));
+}
+
+TEST_F(DocumentURLRequestTest, NoGrantIsWritten) {
+  grant("org.a", "f/i", "org.app");
+  call(name, request("storix:org.a/f/i"));
+  EXPECT_EQ(platform().trace().count("writeKeyedValueFileAtomically"), 0U);
+}
+
+TEST_F(DocumentURLRequestTest, TheStoreIsTheSharedOneServerOrNot) {
+  grant("org.a", "f/i", "org.app");
+  server_.reset();
+  EXPECT_EQ(call(name, request("storix:org.a/f/i"))->error(4), std::nullopt);
+}
+
+TEST_F(DocumentURLRequestTest, NeedsNoReplyHandler) {
+  grant("org.a", "f/i", "org.app");
+  client_->callWithoutReply(name, request("storix:org.a/f/i"));
+  client_->callWithoutReply(name, request("nonsense"));
+  runUntilIdle();
+  process("org.a").setBeginFailure(someError("no process"));
+  client_->callWithoutReply(name, request("storix:org.a/f/i"));
+  runUntilIdle();
+  EXPECT_EQ(platform().trace().count("reply"), 0U);
+}
+
+}  // namespace
+}  // namespace storix

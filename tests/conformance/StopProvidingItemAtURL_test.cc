@@ -1,0 +1,55 @@
+#include "tests/conformance/ItemRequestTest.h"
+
+namespace storix {
+namespace {
+
+using fake::VendorAnswer;
+using ::testing::ElementsAreArray;
+
+using StopProvidingTest = ItemRequestsTest;
+
+TEST_F(StopProvidingTest, StopDoesNotNameTheIdentifierThatDoesNotFitTheOwner) {
+  expectEarlyFailure(stop, arguments(item_, "org.b", "org.app"), ownerFound(),
+                     SXInvalidParameterError("providerID", std::nullopt));
+}
+
+TEST_F(StopProvidingTest, StopIsForwardedWithoutAGrantAndAlwaysAnswersWithAnError) {
+  const Arguments given = arguments(item_, "org.a", "org.app");
+  call(stop.name, given);
+  EXPECT_THAT(trace(),
+              ElementsAreArray(joined(
+                  {served(stop.name, given),
+                   {admitted},
+                   ownerFound(),
+                   message(stop.operation, "org.a", "request-3", stop.message, itemText(), "()"),
+                   {"log debug " + stop.successLine + itemText() + " for extension org.a.",
+                    reply(stop.name, "(" + text(SXPluginOperationFailedError(std::nullopt)) + ")", platformThread),
+                    cancel("org.a", "request-3")}})));
+}
+
+TEST_F(StopProvidingTest, AFailedStopIsLoggedAndWrapped) {
+  const SXError error = someError("busy");
+  process("org.a").setAnswer(stop.message, VendorAnswer::values({Argument(error)}));
+  const std::shared_ptr<fake::FakeReply> answered = call(stop.name, arguments(item_, "org.a", "org.app"));
+  const SXError wrapped = SXPluginOperationFailedError(error);
+  EXPECT_EQ(answered->error(0), SXPluginOperationFailedError(wrapped));
+  EXPECT_EQ(answered->answer().context, platformThread);
+  const std::vector<std::string> lines = trace();
+  ASSERT_GE(lines.size(), 4U);
+  EXPECT_EQ(lines[lines.size() - 4],
+            "log fault " + stop.failureLine + itemText() + " for extension org.a. Error: " + text(error));
+  EXPECT_EQ(lines[lines.size() - 3],
+            "log fault [ERROR] Could not ask provider ID org.a to stop providing item at URL " + itemText() +
+                ". Error: " + text(wrapped));
+}
+
+TEST_F(StopProvidingTest, AProvidersDirectoryItselfHasNoOwner) {
+  const std::optional<URL> directory = storageURL("org.a");
+  const std::vector<std::string> lookup{
+      compared("org.a", *directory),
+      "log debug [DEBUG] Ignoring URLs that exactly match the document container folder"};
+  expectEarlyFailure(stop, arguments(directory, "org.a", "org.app"), lookup, SXNotFoundError("org.a"));
+}
+
+}  // namespace
+}  // namespace storix
