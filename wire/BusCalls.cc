@@ -18,7 +18,7 @@ std::optional<MethodFailure> errorOf(sd_bus_message *reply) {
 
 /// The error value of a message that did not get its answer.
 SXError deliveryError(std::string_view method, const MethodFailure &failure) {
-  const sd_bus_error error = SD_BUS_ERROR_MAKE_CONST(failure.name.c_str(), failure.text.c_str());
+  const sd_bus_error error = borrowedError(failure.name.c_str(), failure.text.c_str());
   std::string description = "\"" + std::string(method) + "\" was not answered: " + failure.text;
   return SXError(std::string(posixErrorDomain), sd_bus_error_get_errno(&error),
                  {{"description", Value(std::move(description))}, {"busError", Value(failure.name)}});
@@ -75,10 +75,10 @@ class MethodWaiter : public Waiter {
 
   Task answered(sd_bus_message *reply) override {
     if (std::optional<MethodFailure> error = errorOf(reply)) return failed(std::move(*error));
+    auto read = readValues(reply, method_.out, method_.outSignature);
     // Values may hold descriptors, which a task cannot copy.
     auto values = std::make_shared<MethodResult>(MethodFailure{});
-    std::visit([&values](auto &&read) { *values = std::move(read); },
-               readValues(reply, method_.out, method_.outSignature));
+    std::visit([&values](auto &content) { *values = std::move(content); }, read);
     const auto *refused = std::get_if<MethodFailure>(values.get());
     return [handler = std::move(handler_), values, refused, name = method_.name, peer = peer_] {
       if (refused) logRefusedReply(name, peer, *refused);

@@ -179,6 +179,7 @@ void BusConnection::loggedIn(Lock &lock) {
   state.loggedIn = true;
   std::deque<Outgoing> unsent = std::exchange(state.unsent, {});
   std::vector<Task> failures;
+  failures.reserve(unsent.size());
   for (Outgoing &outgoing : unsent) failures.push_back(state.transmit(outgoing));
   std::function<void()> ready = std::exchange(state.readyHandler, {});
   lock.unlock();

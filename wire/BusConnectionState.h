@@ -130,7 +130,7 @@ struct BusConnection::State {
   /// Answers a request with a D-Bus error, if it expects an answer.
   static void replyFailure(sd_bus_message *request, const MethodFailure &failure) {
     const std::string text = busText(failure.text);
-    const sd_bus_error error = SD_BUS_ERROR_MAKE_CONST(failure.name.c_str(), text.c_str());
+    const sd_bus_error error = borrowedError(failure.name.c_str(), text.c_str());
     sd_bus_reply_method_error(request, &error);
   }
 };

@@ -148,6 +148,7 @@ TEST_F(BusConnectionTest, RepliesComeLaterFromOtherThreadsAndInAnyOrder) {
   const auto remoteObject = remote();
   constexpr int count = 20;
   std::vector<RecordingObject::Request> requests;
+  requests.reserve(count);
   for (int i = 0; i < count; ++i) {
     remoteObject->send(rowOf("DocumentURLFromBookmarkableString"), {Value(std::to_string(i))}, toReplies());
   }
@@ -158,6 +159,7 @@ TEST_F(BusConnectionTest, RepliesComeLaterFromOtherThreadsAndInAnyOrder) {
     requests.push_back(std::move(*request));
   }
   std::vector<std::thread> threads;
+  threads.reserve(requests.size());
   for (auto &request : requests) {
     threads.emplace_back([&request] { request.reply({{}, {}, {}, {}, Value(SXInvalidBookmarkableStringError())}); });
   }
@@ -198,6 +200,7 @@ TEST_F(BusConnectionTest, EachMessageInFlightHearsOnceThatThePeerIsGone) {
   constexpr int count = 3;
   for (int i = 0; i < count; ++i) remoteObject->send(rowOf("WakeUp"), {}, toReplies());
   std::vector<RecordingObject::Request> requests;
+  requests.reserve(count);
   for (int i = 0; i < count; ++i) requests.push_back(*object_->requests.take());
   (*server_)->close();
   for (int i = 0; i < count; ++i) {
@@ -339,6 +342,7 @@ TEST_F(BusConnectionTest, TheRequestAfterTheLimitWaitsUntilOneIsAnswered) {
   const auto remoteObject = remote();
   for (std::size_t i = 0; i <= limit; ++i) remoteObject->send(rowOf("WakeUp"), {}, toReplies());
   std::vector<RecordingObject::Request> requests;
+  requests.reserve(limit);
   for (std::size_t i = 0; i < limit; ++i) requests.push_back(*object_->requests.take());
   EXPECT_EQ(object_->requests.count(), 0U);
   EXPECT_FALSE((*server_)->wanted().events & POLLIN) << "nothing more is read";
@@ -363,6 +367,7 @@ TEST_F(BusConnectionTest, PeerThatGoesWithTooManyRequestsInFlightIsNoticed) {
   const auto remoteObject = remote();
   for (std::size_t i = 0; i < limit; ++i) remoteObject->send(rowOf("WakeUp"), {}, toReplies());
   std::vector<RecordingObject::Request> requests;
+  requests.reserve(limit);
   for (std::size_t i = 0; i < limit; ++i) requests.push_back(*object_->requests.take());
   client()->close();
   EXPECT_TRUE(closed_.take());

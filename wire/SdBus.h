@@ -22,6 +22,9 @@ struct MessageDeleter {
 };
 using OwnedMessage = std::unique_ptr<sd_bus_message, MessageDeleter>;
 
+/// A D-Bus error that borrows both texts.
+inline sd_bus_error borrowedError(const char *name, const char *message) { return {name, message, 0}; }
+
 /// The error value of a negative sd-bus result.
 inline SXError busError(int negativeErrno, std::string_view doing) {
   return posixError(negativeErrno < 0 ? -negativeErrno : negativeErrno, doing);

@@ -140,7 +140,7 @@ class PlainClient {
 
   /// The reply, or null; then `errorName` and `errorText` say why.
   OwnedMessage call(const OwnedMessage &request) {
-    sd_bus_error error = SD_BUS_ERROR_NULL;
+    sd_bus_error error = borrowedError(nullptr, nullptr);
     sd_bus_message *reply = nullptr;
     const int result = sd_bus_call(bus_.get(), request.get(), 60'000'000, &error, &reply);
     errorName = error.name ? error.name : "";

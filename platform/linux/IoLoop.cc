@@ -176,7 +176,7 @@ class IoLoop::Implementation::EpollWatch : public IoLoop::Watch {
     implementation_->disarm(*entry_);
     if (entry_->running && entry_->runner == std::this_thread::get_id()) return;
     entry_->served.wait(lock, [this] { return !entry_->running; });
-    const IoLoop::Handler ended = std::move(entry_->handler);
+    const IoLoop::Handler unused = std::move(entry_->handler);
     lock.unlock();
   }
 
