@@ -207,6 +207,21 @@ TEST(KTStorixExtensionHostContext, TheVendorProtocolHasItsOperationsInOrder) {
   }
 }
 
+TEST(KTStorixExtensionHostContext, TheVendorProtocolHasItsWordsForTheWire) {
+  const ProtocolDescription &description = _KTStorixVendorProtocol().description();
+  EXPECT_EQ(description.name, "_KTStorixVendor");
+  EXPECT_EQ(description.interfaceName, "com.tessel.StorixVendor");
+  EXPECT_EQ(description.objectPath, "/com/tessel/StorixVendor");
+  EXPECT_EQ(words(description),
+            "PerformInitialSetup() -> (string, URL, error)\n"
+            "ProvidePlaceholderAtURL(URL) -> (placeholderURL, error)\n"
+            "StartProvidingItemAtURL(URL) -> (error)\n"
+            "ItemChangedAtURL(URL) -> (error)\n"
+            "StopProvidingItemAtURL(URL) -> (error)\n"
+            "IdentifierForItemAtURL(URL) -> (error, itemIdentifier)\n"
+            "URLForItemIdentifier(itemIdentifier) -> (error, URL)\n");
+}
+
 TEST(KTStorixExtensionHostContext, ConcurrentFirstCallsGetTheIdenticalInterface) {
   constexpr std::size_t threadCount = 8;
   std::vector<const LinkInterface *> vendors(threadCount);

@@ -16,6 +16,22 @@
 
 namespace storix {
 
+/// The operations of a protocol as they stand on the wire, a line each: "Method(argument) -> (reply)".
+inline std::string words(const ProtocolDescription &protocol) {
+  const auto list = [](const std::vector<ArgumentDescription> &arguments) {
+    std::string text;
+    for (const ArgumentDescription &argument : arguments) {
+      text += (text.empty() ? "" : ", ") + std::string(argument.name);
+    }
+    return "(" + text + ")";
+  };
+  std::string text;
+  for (const OperationDescription &operation : protocol.operations) {
+    text += std::string(operation.method) + list(operation.arguments) + " -> " + list(operation.replies) + "\n";
+  }
+  return text;
+}
+
 /// A fake host that knows the context class of provider extensions, and words for its trace.
 class ProvidersTest : public fake::FakeHostTest {
  protected:

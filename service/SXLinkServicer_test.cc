@@ -135,5 +135,24 @@ TEST(SXDaemonProtocol, HasItsNineOperationsInOrder) {
   }
 }
 
+TEST(SXDaemonProtocol, HasItsWordsForTheWire) {
+  const ProtocolDescription &description = SXDaemonProtocol().description();
+  EXPECT_EQ(description.name, "SXDaemon");
+  EXPECT_EQ(description.interfaceName, "com.tessel.Storix.Daemon");
+  EXPECT_EQ(description.objectPath, "/com/tessel/Storix");
+  EXPECT_EQ(words(description),
+            "WakeUp() -> ()\n"
+            "ExtendSandboxForFileURL(fileURL, providerID, consumerID) -> (error, tokenData, companionURL, "
+            "companionTokenData)\n"
+            "ProvidePlaceholderForItemAtURL(URL, providerID, consumerID) -> (error)\n"
+            "StartProvidingItemAtURL(URL, providerID, consumerID) -> (error)\n"
+            "StopProvidingItemAtURL(URL, providerID, consumerID) -> (error)\n"
+            "Providers() -> (error, providers)\n"
+            "ExtendBookmarkForFileURL(fileURL, consumerID) -> (bookmarkableString, error)\n"
+            "BookmarkableStringFromDocumentURL(URL) -> (bookmarkableString, error)\n"
+            "DocumentURLFromBookmarkableString(bookmarkableString) -> (URL, tokenData, companionURL, "
+            "companionTokenData, error)\n");
+}
+
 }  // namespace
 }  // namespace storix

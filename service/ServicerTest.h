@@ -23,6 +23,8 @@ class StoreOwner : public AccessControlSource {
 /// A client's connection with a servicer exported on it, and two providers, "org.a" and "org.b".
 class ServicerTest : public ProvidersTest {
  protected:
+  explicit ServicerTest(fake::FakePlatform::Options options = {}) : ProvidersTest(std::move(options)) {}
+
   using Text = std::optional<std::string>;
 
   static constexpr const char *readEntitlement = "com.tessel.storix.acl-read";

@@ -86,5 +86,59 @@ TEST_F(BookmarkableStringRequestTest, NeedsNoReplyHandler) {
   EXPECT_EQ(platform().trace().count("reply"), 0U);
 }
 
+TEST_F(BookmarkableStringRequestTest, WhereThePathReallyLeadsDecidesWhoOwnsIt) {
+  platform().files().makeDirectory("/elsewhere");
+  platform().files().makeSymbolicLink(storagePath("org.a") + "/out", "/elsewhere");
+  platform().files().makeSymbolicLink("/elsewhere/in", storagePath("org.a"));
+  const auto isOwned = [this](const std::string &url) {
+    const std::shared_ptr<fake::FakeReply> answered = call(name, request(URL::fromString(url)));
+    EXPECT_EQ(answered->error(1), std::nullopt) << url;
+    return answered->answer().values.at(0) == Argument("storix:org.a/f/i");
+  };
+  const std::string directory = storageText("org.a");
+  EXPECT_TRUE(isOwned(directory + "not/made/yet"));
+  EXPECT_TRUE(isOwned(directory + "a/../b"));
+  EXPECT_TRUE(isOwned(directory + "../Storix%20Storage/b"));
+  EXPECT_TRUE(isOwned("file:///elsewhere/in/b"));
+  EXPECT_FALSE(isOwned(directory + "../b"));
+  EXPECT_FALSE(isOwned(directory + "out/b"));
+  EXPECT_FALSE(isOwned("file:///"));
+  EXPECT_EQ(platform().log().take().empty(), false);
+}
+
+TEST_F(BookmarkableStringRequestTest, AProvidersDirectoryItselfIsNobodys) {
+  const std::optional<URL> directory = storageURL("org.a");
+  call(name, request(directory));
+  EXPECT_THAT(
+      trace(),
+      ElementsAreArray(joined({start(directory),
+                               {compared("org.a", *directory),
+                                "log debug [DEBUG] Ignoring URLs that exactly match the document container folder",
+                                "log info [INFO] Could not find the provider for URL " + directory->absoluteString(),
+                                reply(name, "((null), (null))", global)}})));
+}
+
+TEST_F(BookmarkableStringRequestTest, AProviderWithoutADirectoryOwnsNothingYet) {
+  platform().files().remove(storagePath("org.a"));
+  call(name, request(item_));
+  EXPECT_THAT(trace(),
+              ElementsAreArray(joined(
+                  {start(item_),
+                   {compared("org.a", *item_),
+                    "log debug [DEBUG] Storix provider org.a doesn't have a provided items directory; it "
+                    "may not have run so far.",
+                    compared("org.b", *item_), "log info [INFO] Could not find the provider for URL " + itemText(),
+                    reply(name, "((null), (null))", global)}})));
+}
+
+TEST_F(BookmarkableStringRequestTest, ALateConnectionFailureRepliesAgainWithAnError) {
+  const SXError error = someError("it ended");
+  process("org.a").setAnswer(identify, VendorAnswer::valuesThenConnectionFailure({Argument(), Argument("f/i")}, error));
+  const std::shared_ptr<fake::FakeReply> answered = call(name, request(item_));
+  ASSERT_EQ(answered->answers().size(), 2U);
+  EXPECT_EQ(answered->answer().values, (Arguments{Argument("storix:org.a/f/i"), Argument()}));
+  EXPECT_EQ(answered->answers()[1].values, (Arguments{Argument(), Argument(SXPluginOperationFailedError(error))}));
+}
+
 }  // namespace
 }  // namespace storix

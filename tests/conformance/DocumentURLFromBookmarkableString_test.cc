@@ -61,8 +61,13 @@ TEST_F(DocumentURLRequestTest, ACallerWithoutBundleIsNotPermittedWhateverTheStri
 }
 
 TEST_F(DocumentURLRequestTest, AMalformedStringIsInvalid) {
-  for (const char *string : {"storix:org.sample.docs//a", "storix:/a", "storix:org.sample.docs",
-                             " storix:org.sample.docs/a", "Storix:org.sample.docs/a", ""}) {
+  for (const std::string &string :
+       {std::string(), std::string("storix:"), std::string("storix:/"), std::string("storix://"), std::string("//"),
+        std::string("storix:/a"), std::string("storix:org.sample.docs"), std::string("storix:org.sample.docs/"),
+        std::string("storix:org.sample.docs//a"), std::string("storix:org.sample.docs//"),
+        std::string(" storix:org.sample.docs/a"), std::string("  storix:org.sample.docs/a"),
+        std::string("Storix:org.sample.docs/a"), std::string("STORIX:org.sample.docs/a"),
+        std::string("xstorix:org.sample.docs/a"), "storix:" + std::string(65536, '/'), std::string(65536, '/')}) {
     call(name, request(string));
     EXPECT_THAT(trace(),
                 ElementsAreArray(joined({start(string), {failed(SXInvalidBookmarkableStringError(), global)}})));
@@ -139,6 +144,47 @@ TEST_F(DocumentURLRequestTest, NeedsNoReplyHandler) {
   client_->callWithoutReply(name, request("storix:org.a/f/i"));
   runUntilIdle();
   EXPECT_EQ(platform().trace().count("reply"), 0U);
+}
+
+TEST_F(DocumentURLRequestTest, WhatStaysUnansweredStaysSoWhenTheProviderComesLater) {
+  grant("org.c", "i", "org.app");
+  const std::shared_ptr<fake::FakeReply> answered = call(name, request("storix:org.c/i"));
+  platform().extensions().install(fake::completeProvider("org.c"));
+  platform().extensions().deliver();
+  runUntilIdle();
+  ASSERT_NE(SXExtensionStorix::providerWithIdentifier("org.c"), nullptr);
+  platform().advance(std::chrono::hours(24));
+  call(SXDaemon::wakeUpName);
+  EXPECT_FALSE(answered->isAnswered());
+  EXPECT_EQ(platform().trace().count("send request-3 _URLForItemIdentifier:"), 0U);
+  // The same string sent now is answered.
+  EXPECT_TRUE(call(name, request("storix:org.c/i"))->isAnswered());
+}
+
+TEST_F(DocumentURLRequestTest, AFailedBeginIsASandboxFailureAndTheRequestStaysOpen) {
+  grant("org.a", "f/i", "org.app");
+  const SXError error = someError("no process");
+  process("org.a").setBeginFailure(error);
+  call(name, request("storix:org.a/f/i"));
+  EXPECT_THAT(trace(),
+              ElementsAreArray(joined(
+                  {start("storix:org.a/f/i"),
+                   {"log debug [DEBUG] -[SXExtensionStorix URLForItemID:completionHandler:]",
+                    "beginExtensionRequest org.a version 1 request-3", "begin failed request-3 " + text(error),
+                    "log debug [DEBUG] Beginning extension request.",
+                    "log fault [ERROR] Extension request failed. Error: " + text(error),
+                    "log fault [ERROR] Cannot get URL for item ID “f/i” for extension org.a. Error: " + text(error),
+                    failed(SXSandboxExtensionFailedError(std::nullopt), platformThread)}})));
+}
+
+TEST_F(DocumentURLRequestTest, ALateConnectionFailureRepliesAgainWithAnError) {
+  grant("org.a", "f/i", "org.app");
+  process("org.a").setAnswer(
+      locate, VendorAnswer::valuesThenConnectionFailure({Argument(), Argument(*item_)}, someError("it ended")));
+  const std::shared_ptr<fake::FakeReply> answered = call(name, request("storix:org.a/f/i"));
+  ASSERT_EQ(answered->answers().size(), 2U);
+  EXPECT_EQ(answered->error(4), std::nullopt);
+  EXPECT_EQ(answered->answers()[1].values.at(4), Argument(SXSandboxExtensionFailedError(std::nullopt)));
 }
 
 }  // namespace

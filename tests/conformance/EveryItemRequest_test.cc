@@ -173,7 +173,11 @@ TEST_P(GrantedItemRequestTest, ALateConnectionFailureRepliesAgain) {
   grant("org.a", "f/i", "org.app");
   process("org.a").setAnswer(GetParam().message,
                              VendorAnswer::valuesThenConnectionFailure({}, someError("the process ended")));
-  EXPECT_EQ(call(GetParam().name, arguments(item_, "org.a", "org.app"))->answers().size(), 2U);
+  const std::shared_ptr<fake::FakeReply> answered = call(GetParam().name, arguments(item_, "org.a", "org.app"));
+  ASSERT_EQ(answered->answers().size(), 2U);
+  EXPECT_EQ(answered->answer().values, Arguments(1));
+  EXPECT_EQ(answered->answers()[1].values,
+            (Arguments{Argument(SXPluginOperationFailedError(someError("the process ended")))}));
 }
 
 }  // namespace

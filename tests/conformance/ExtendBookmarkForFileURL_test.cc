@@ -140,5 +140,37 @@ TEST_F(ExtendBookmarkTest, WithoutAConnectionTheTokenIsAllZero) {
                           "answered ((null), " + text(SXNotPermittedError()) + ") on " + global));
 }
 
+TEST_F(ExtendBookmarkTest, AProvidersDirectoryItselfIsNotFound) {
+  const std::optional<URL> directory = storageURL("org.a");
+  platform().sandbox().allowAccess(client_->auditToken(), directory->path());
+  call(bookmark, request(directory, "org.app"));
+  EXPECT_THAT(trace(), ElementsAreArray(
+                           joined({start(directory, "org.caller", "org.app"),
+                                   {compared("org.a", *directory),
+                                    "log debug [DEBUG] Ignoring URLs that exactly match the document container folder"},
+                                   failure(directory, "org.caller", "org.app", SXNotFoundErrorURL(directory))})));
+}
+
+TEST_F(ExtendBookmarkTest, AFailureLeavesTheStoreAndItsFileAsTheyWere) {
+  grant("org.a", "other", "org.app");
+  process("org.a").setAnswer(identify, VendorAnswer::values({Argument(someError("no such item")), Argument("f/i")}));
+  call(bookmark, request(item_, "org.app"));
+  call(bookmark, request(std::nullopt, "org.app"));
+  EXPECT_FALSE(store()->isProviderWithIdentifier("org.a", "f/i", "org.app"));
+  EXPECT_TRUE(store()->isProviderWithIdentifier("org.a", "other", "org.app"));
+  EXPECT_EQ(platform().files().writeCount("/home/u/Library/Storix/AccessControl.kvs"), 1U);
+}
+
+TEST_F(ExtendBookmarkTest, ALateConnectionFailureRepliesAgainWithAnErrorAndTheGrantStays) {
+  const SXError error = someError("it ended");
+  process("org.a").setAnswer(identify, VendorAnswer::valuesThenConnectionFailure({Argument(), Argument("f/i")}, error));
+  const std::shared_ptr<fake::FakeReply> answered = call(bookmark, request(item_, "org.app"));
+  ASSERT_EQ(answered->answers().size(), 2U);
+  EXPECT_EQ(answered->answer().values, (Arguments{Argument("storix:org.a/f/i"), Argument()}));
+  EXPECT_EQ(answered->answers()[1].values,
+            (Arguments{Argument(), Argument(SXPluginOperationFailedError(SXPluginOperationFailedError(error)))}));
+  EXPECT_TRUE(store()->isProviderWithIdentifier("org.a", "f/i", "org.app"));
+}
+
 }  // namespace
 }  // namespace storix

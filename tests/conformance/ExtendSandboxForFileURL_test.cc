@@ -145,7 +145,13 @@ TEST_F(ExtendSandboxTest, ALateConnectionFailureRepliesAgain) {
   process("org.a").setAnswer(identify, VendorAnswer::valuesThenConnectionFailure({Argument(), Argument("f/i")},
                                                                                  someError("the process ended")));
   const std::shared_ptr<fake::FakeReply> answer = call(extend, arguments(item_, "org.a", "org.app"));
-  EXPECT_EQ(answer->answers().size(), 2U);
+  ASSERT_EQ(answer->answers().size(), 2U);
+  EXPECT_EQ(answer->error(0), std::nullopt);
+  EXPECT_EQ(
+      answer->answers()[1].values,
+      (Arguments{Argument(SXPluginOperationFailedError(SXPluginOperationFailedError(someError("the process ended")))),
+                 Argument(), Argument(), Argument()}));
+  EXPECT_TRUE(store()->isProviderWithIdentifier("org.a", "f/i", "org.app"));
 }
 
 using ExtendSandboxDeathTest = ExtendSandboxTest;
@@ -153,6 +159,45 @@ using ExtendSandboxDeathTest = ExtendSandboxTest;
 TEST_F(ExtendSandboxDeathTest, AProviderThatGivesNeitherIdentifierNorErrorIsPassedOnToTheStore) {
   process("org.a").setAnswer(identify, VendorAnswer::values());
   EXPECT_DEATH(call(extend, arguments(item_, "org.a", "org.app")), "programming error");
+}
+
+TEST_F(ExtendSandboxTest, AFailedBeginGrantsNothingAndLeavesTheRequestOpen) {
+  const SXError error = someError("no process");
+  process("org.a").setBeginFailure(error);
+  const Arguments request = arguments(item_, "org.a", "org.app");
+  call(extend, request);
+  const SXError wrapped = SXPluginOperationFailedError(SXPluginOperationFailedError(error));
+  EXPECT_THAT(trace(), ElementsAreArray(joined(
+                           {served(extend, request),
+                            {"entitlementValue peer 100 com.tessel.storix.acl-write",
+                             "log debug [DEBUG] -[SXExtensionStorix itemIDForURL:completionHandler:]",
+                             "beginExtensionRequest org.a version 1 request-3", "begin failed request-3 " + text(error),
+                             "log debug [DEBUG] Beginning extension request.",
+                             "log fault [ERROR] Extension request failed. Error: " + text(error),
+                             "log fault [ERROR] Cannot get item ID for URL " + itemText() +
+                                 " for extension org.a. Error: " + text(error),
+                             reply(extend, absentAfter(wrapped), platformThread)}})));
+  EXPECT_FALSE(platform().files().exists("/home/u/Library/Storix/AccessControl.kvs"));
+}
+
+TEST_F(ExtendSandboxTest, TheSameGrantAgainIsNotWrittenAgainButGetsTokens) {
+  grant("org.a", "f/i", "org.app");
+  const std::shared_ptr<fake::FakeReply> answer = call(extend, arguments(item_, "org.a", "org.app"));
+  EXPECT_EQ(answer->error(0), std::nullopt);
+  EXPECT_TRUE(answer->answer().values.at(1));
+  EXPECT_EQ(platform().trace().count("writeKeyedValueFileAtomically"), 0U);
+  EXPECT_TRUE(platform().log().contains(
+      LogSeverity::info,
+      "[INFO] Provider ID org.a is already allowed to provide item ID “f/i” to consumer ID org.app."));
+}
+
+TEST_F(ExtendSandboxTest, AGrantThatCannotBeWrittenIsGivenAllTheSame) {
+  platform().files().setUnwritable("/home/u/Library/Storix/AccessControl.kvs");
+  const std::shared_ptr<fake::FakeReply> answer = call(extend, arguments(item_, "org.a", "org.app"));
+  EXPECT_EQ(answer->error(0), std::nullopt);
+  EXPECT_TRUE(store()->isProviderWithIdentifier("org.a", "f/i", "org.app"));
+  EXPECT_TRUE(platform().log().contains(LogSeverity::fault,
+                                        "[ERROR] Could not write to /home/u/Library/Storix/AccessControl.kvs"));
 }
 
 }  // namespace

@@ -106,5 +106,29 @@ TEST_F(ProvideItemTest, TheServiceReachesTheProviderOnItsOwnQueueAndGetsItsAnswe
   EXPECT_THAT(trace(), Contains("provided " + urlText() + " (null) on platform thread"));
 }
 
+TEST_F(ProvideItemTest, NoGrantIsAskedFor) {
+  provider()->_provideItemAtURL(url_, "reader-nobody-knows", recording<SXError>("answered"));
+  runUntilIdle();
+  EXPECT_EQ(platform().trace().count("answered ((null))"), 1U);
+}
+
+TEST_F(ProvideItemTest, AFailedBeginIsReportedAndTheRequestStaysOpen) {
+  const SXError error = someError("no process");
+  process("org.a").setBeginFailure(error);
+  provider()->_provideItemAtURL(url_, "reader-1", recording<SXError>("answered"));
+  runUntilIdle();
+  EXPECT_EQ(platform().trace().count("answered (" + text(SXPluginOperationFailedError(error)) + ")"), 1U);
+  EXPECT_EQ(platform().trace().count("cancelExtensionRequest"), 0U);
+}
+
+TEST_F(ProvideItemTest, ALateConnectionFailureAnswersAgain) {
+  const SXError error = someError("it ended");
+  process("org.a").setAnswer(start, VendorAnswer::valuesThenConnectionFailure({}, error));
+  provider()->_provideItemAtURL(url_, "reader-1", recording<SXError>("answered"));
+  runUntilIdle();
+  EXPECT_EQ(platform().trace().count("answered ((null))"), 1U);
+  EXPECT_EQ(platform().trace().count("answered (" + text(SXPluginOperationFailedError(error)) + ")"), 1U);
+}
+
 }  // namespace
 }  // namespace storix

@@ -20,5 +20,30 @@ TEST_F(StartProvidingTest, AProvidersDirectoryItselfHasNoOwner) {
   expectEarlyFailure(start, arguments(directory, "org.a", "org.app"), lookup, SXNotFoundError("org.a"));
 }
 
+TEST_F(StartProvidingTest, AFailedBeginIsReportedTwiceWrappedAndTheRequestStaysOpen) {
+  const SXError error = someError("no process");
+  process("org.a").setBeginFailure(error);
+  const std::shared_ptr<fake::FakeReply> answered = call(start.name, arguments(item_, "org.a", "org.app"));
+  EXPECT_EQ(answered->error(0), SXPluginOperationFailedError(SXPluginOperationFailedError(error)));
+  EXPECT_EQ(platform().trace().count("cancelExtensionRequest"), 0U);
+  EXPECT_EQ(platform().trace().count("log fault [ERROR] Cannot get item ID for URL " + itemText()), 1U);
+}
+
+TEST_F(StartProvidingTest, ASecondBeginThatFailsIsReportedOnceWrappedAndThatRequestStaysOpen) {
+  grant("org.a", "f/i", "org.app");
+  const SXError error = someError("no process");
+  process("org.a").setAnswer("IdentifierForItemAtURL", [this, &error](const Arguments &) {
+    process("org.a").setBeginFailure(error);
+    return fake::VendorAnswer::values({Argument(), Argument("f/i")});
+  });
+  const std::shared_ptr<fake::FakeReply> answered = call(start.name, arguments(item_, "org.a", "org.app"));
+  EXPECT_EQ(answered->error(0), SXPluginOperationFailedError(error));
+  EXPECT_EQ(platform().trace().count(cancel("org.a", "request-3")), 1U);
+  EXPECT_EQ(platform().trace().count("cancelExtensionRequest"), 1U);
+  EXPECT_EQ(platform().trace().count("log fault [ERROR] Cannot provide item at URL " + itemText() +
+                                     " for extension org.a. Error: " + text(error)),
+            1U);
+}
+
 }  // namespace
 }  // namespace storix

@@ -3,7 +3,6 @@
 namespace storix {
 namespace {
 
-using fake::VendorAnswer;
 using ::testing::ElementsAreArray;
 
 using StopProvidingTest = ItemRequestsTest;
@@ -29,7 +28,7 @@ TEST_F(StopProvidingTest, StopIsForwardedWithoutAGrantAndAlwaysAnswersWithAnErro
 
 TEST_F(StopProvidingTest, AFailedStopIsLoggedAndWrapped) {
   const SXError error = someError("busy");
-  process("org.a").setAnswer(stop.message, VendorAnswer::values({Argument(error)}));
+  process("org.a").setAnswer(stop.message, fake::VendorAnswer::values({Argument(error)}));
   const std::shared_ptr<fake::FakeReply> answered = call(stop.name, arguments(item_, "org.a", "org.app"));
   const SXError wrapped = SXPluginOperationFailedError(error);
   EXPECT_EQ(answered->error(0), SXPluginOperationFailedError(wrapped));
@@ -49,6 +48,38 @@ TEST_F(StopProvidingTest, AProvidersDirectoryItselfHasNoOwner) {
       compared("org.a", *directory),
       "log debug [DEBUG] Ignoring URLs that exactly match the document container folder"};
   expectEarlyFailure(stop, arguments(directory, "org.a", "org.app"), lookup, SXNotFoundError("org.a"));
+}
+
+TEST_F(StopProvidingTest, AFailedBeginIsLoggedTwiceAndTheRequestStaysOpen) {
+  const SXError error = someError("no process");
+  process("org.a").setBeginFailure(error);
+  const Arguments given = arguments(item_, "org.a", "org.app");
+  call(stop.name, given);
+  const SXError wrapped = SXPluginOperationFailedError(error);
+  EXPECT_THAT(trace(),
+              ElementsAreArray(joined(
+                  {served(stop.name, given),
+                   {admitted},
+                   ownerFound(),
+                   {"log debug [DEBUG] -[SXExtensionStorix stopProvidingItemAtURL:completionHandler:]",
+                    "beginExtensionRequest org.a version 1 request-3", "begin failed request-3 " + text(error),
+                    "log debug [DEBUG] Beginning extension request.",
+                    "log fault [ERROR] Extension request failed. Error: " + text(error),
+                    "log fault [ERROR] Cannot stop providing item at URL " + itemText() +
+                        " for extension org.a. Error: " + text(error),
+                    "log fault [ERROR] Could not ask provider ID org.a to stop providing item at URL " + itemText() +
+                        ". Error: " + text(wrapped),
+                    reply(stop.name, "(" + text(SXPluginOperationFailedError(wrapped)) + ")", platformThread)}})));
+}
+
+TEST_F(StopProvidingTest, ALateConnectionFailureRepliesAgainWithItsError) {
+  const SXError error = someError("it ended");
+  process("org.a").setAnswer(stop.message, fake::VendorAnswer::valuesThenConnectionFailure({}, error));
+  const std::shared_ptr<fake::FakeReply> answered = call(stop.name, arguments(item_, "org.a", "org.app"));
+  ASSERT_EQ(answered->answers().size(), 2U);
+  EXPECT_EQ(answered->error(0), SXPluginOperationFailedError(std::nullopt));
+  EXPECT_EQ(answered->answers()[1].values,
+            (Arguments{Argument(SXPluginOperationFailedError(SXPluginOperationFailedError(error)))}));
 }
 
 }  // namespace

@@ -57,5 +57,28 @@ TEST_F(FinishedWriteTest, AWriteOfAProvidersDirectoryItselfIsPassedOver) {
   EXPECT_EQ(platform().trace().count("beginExtensionRequest"), 0U);
 }
 
+TEST_F(FinishedWriteTest, AFailedBeginIsLoggedWithoutItsErrorAndTheRequestIsEnded) {
+  process("org.a").setBeginFailure(someError("no process"));
+  provider()->_writerWithID("writer-1", url_);
+  runUntilIdle();
+  const std::vector<std::string> lines = trace();
+  ASSERT_GE(lines.size(), 2U);
+  EXPECT_EQ(lines[lines.size() - 2],
+            "log fault [ERROR] Cannot tell extension org.a that item at URL " + urlText() + " has changed.");
+  EXPECT_EQ(lines.back(), "cancelExtensionRequest org.a version 1 request-3");
+}
+
+TEST_F(FinishedWriteTest, TheExtensionsErrorIsLoggedAndTheRequestIsEnded) {
+  const SXError error = someError("busy");
+  process("org.a").setAnswer("_itemChangedAtURL:completion:", fake::VendorAnswer::values({Argument(error)}));
+  provider()->_writerWithID("writer-1", url_);
+  runUntilIdle();
+  const std::vector<std::string> lines = trace();
+  ASSERT_GE(lines.size(), 2U);
+  EXPECT_EQ(lines[lines.size() - 2], "log fault [ERROR] Could not tell extension org.a that item at URL " + urlText() +
+                                         " has changed. Error: " + text(error));
+  EXPECT_EQ(lines.back(), "cancelExtensionRequest org.a version 1 request-3");
+}
+
 }  // namespace
 }  // namespace storix
