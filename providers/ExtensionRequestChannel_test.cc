@@ -171,6 +171,8 @@ TEST(KTStorixExtensionHostContext, NamesTheTwoProtocols) {
   EXPECT_EQ(_KTStorixExtensionHostContext::name, "_KTStorixExtensionHostContext");
   const ProtocolDescription &host = _KTStorixExtensionHostContext::_extensionAuxiliaryHostProtocol().protocol();
   EXPECT_EQ(host.name, "_KTStorixHostProtocol");
+  EXPECT_EQ(host.interfaceName, "com.tessel.StorixHost");
+  EXPECT_EQ(host.objectPath, "/com/tessel/StorixHost");
   EXPECT_TRUE(host.operations.empty());
   EXPECT_EQ(&_KTStorixExtensionHostContext::_extensionAuxiliaryVendorProtocol().protocol(),
             &_KTStorixVendorProtocol().description());

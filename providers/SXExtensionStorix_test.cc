@@ -103,6 +103,25 @@ TEST_F(SXExtensionStorixTest, SettersReturnBeforeTheValueIsStoredAndReadsAfterTh
   EXPECT_EQ(provider->extension(), record);
 }
 
+TEST_F(SXExtensionStorixTest, SettersWaitForTheReadersBeforeThem) {
+  const std::shared_ptr<SXExtensionStorix> provider = make(completeProvider("org.a"));
+  bool wasRead = false;
+  provider->memberQueue()->async([this, &provider, &wasRead] {
+    // Whatever could run beside this reader runs now.
+    while (platform().runOne()) continue;
+    EXPECT_EQ(provider->memberQueueIdentifier(), "org.a");
+    EXPECT_EQ(provider->memberQueueProvidedItemsURL(), storageURL("org.a"));
+    EXPECT_EQ(provider->memberQueueExtension()->identifier(), "org.a");
+    wasRead = true;
+  });
+  provider->setIdentifier("org.b");
+  provider->setProvidedItemsURL(std::nullopt);
+  provider->setExtension(platform().extensions().makeRecord(completeProvider("org.b")));
+  runUntilIdle();
+  EXPECT_TRUE(wasRead);
+  EXPECT_EQ(provider->memberQueueIdentifier(), "org.b");
+}
+
 TEST_F(SXExtensionStorixTest, WithoutAnIdentifierOfItsOwnItHasThatOfTheRecord) {
   const std::shared_ptr<SXExtensionStorix> provider = make(completeProvider("org.a"));
   provider->setIdentifier(std::nullopt);
