@@ -25,7 +25,6 @@ namespace busErrorName {
 inline constexpr std::string_view invalidArgs = "org.freedesktop.DBus.Error.InvalidArgs";
 inline constexpr std::string_view limitsExceeded = "org.freedesktop.DBus.Error.LimitsExceeded";
 inline constexpr std::string_view accessDenied = "org.freedesktop.DBus.Error.AccessDenied";
-inline constexpr std::string_view notSupported = "org.freedesktop.DBus.Error.NotSupported";
 inline constexpr std::string_view disconnected = "org.freedesktop.DBus.Error.Disconnected";
 }  // namespace busErrorName
 
