@@ -42,6 +42,7 @@ class ConcurrencyTest : public ServicerTest {
   /// One request for each item, none waited for.
   std::vector<Reply> callForEach(std::string_view name) {
     std::vector<Reply> replies;
+    replies.reserve(requestCount);
     for (int i = 0; i < requestCount; ++i) replies.push_back(client_->call(name, request(i)));
     return replies;
   }
@@ -95,6 +96,7 @@ TEST_F(ConcurrencyTest, GrantsOfOneClientSideBySideAreAllMadeAndAnsweredOnce) {
 TEST_F(ConcurrencyTest, TheSameGrantManyTimesIsWrittenOnce) {
   process("org.a").setAnswer(identify, nameTheItemLater);
   std::vector<Reply> replies;
+  replies.reserve(requestCount);
   for (int i = 0; i < requestCount; ++i) replies.push_back(client_->call(SXDaemon::extendSandboxName, request(0)));
   runUntilIdle();
   process("org.a").releaseAllAnswers();
@@ -128,7 +130,7 @@ TEST_F(ConcurrencyTest, RequestsOfEveryKindSideBySideAreAnsweredOnceEach) {
 
 TEST_F(ConcurrencyTest, LookupsDuringRefreshesAlwaysFindAProviderThatStays) {
   std::atomic<bool> done = false;
-  const auto lookUp = [this, &done] {
+  const auto lookUp = [&done] {
     const URL url = itemURL("org.a", "x");
     do {
       const std::shared_ptr<SXExtensionStorix> owner = SXExtensionStorix::providerForURL(url);
