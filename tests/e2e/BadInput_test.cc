@@ -12,6 +12,8 @@
 namespace storix::e2e {
 namespace {
 
+using namespace std::string_literals;
+
 /// A D-Bus client without any of our code.
 class BareClient {
  public:
@@ -28,7 +30,7 @@ class BareClient {
   /// answer.
   template <class... Arguments>
   std::string call(const char *method, const char *signature, Arguments... arguments) {
-    sd_bus_error error = SD_BUS_ERROR_NULL;
+    sd_bus_error error{};
     const int result = sd_bus_call_method(bus_, nullptr, "/com/tessel/Storix", "com.tessel.Storix.Daemon", method,
                                           &error, nullptr, signature, arguments...);
     std::string name = result < 0 ? (error.name ? error.name : std::strerror(-result)) : "";
@@ -150,7 +152,7 @@ TEST_F(BadInput, JunkInsteadOfALoginEndsThatConnectionAlone) {
 TEST_F(BadInput, JunkAfterTheLoginEndsThatConnectionAlone) {
   startWithBystander();
   const UniqueFd socket = connectTo(session.serviceSocket().string());
-  std::string bytes = std::string("\0AUTH EXTERNAL\r\nDATA\r\nBEGIN\r\n", 30);
+  std::string bytes = "\0AUTH EXTERNAL\r\nDATA\r\nBEGIN\r\n"s;
   bytes.append(64, '\xff');
   ASSERT_EQ(static_cast<ssize_t>(bytes.size()), ::send(socket.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL));
   EXPECT_TRUE(isClosed(socket));
