@@ -179,13 +179,8 @@ TEST(KTStorixExtensionHostContext, NamesTheTwoProtocols) {
 }
 
 TEST(KTStorixExtensionHostContext, TheVendorProtocolHasItsOperationsInOrder) {
-  struct Row {
-    std::string_view name;
-    std::vector<ValueKind> arguments;
-    std::vector<ValueKind> replies;
-  };
   using enum ValueKind;
-  const std::vector<Row> rows{
+  const std::vector<ExpectedRow> rows{
       {"_performInitialSetupWithCompletion:", {}, {string, ValueKind::URL, error}},
       {"_providePlaceholderAtURL:completion:", {ValueKind::URL}, {ValueKind::URL, error}},
       {"_startProvidingItemAtURL:completion:", {ValueKind::URL}, {error}},
@@ -194,19 +189,7 @@ TEST(KTStorixExtensionHostContext, TheVendorProtocolHasItsOperationsInOrder) {
       {"_identifierForItemAtURL:completion:", {ValueKind::URL}, {error, string}},
       {"_URLForItemIdentifier:completion:", {string}, {error, ValueKind::URL}},
   };
-  const std::vector<OperationDescription> &operations = _KTStorixVendorProtocol().description().operations;
-  const auto kinds = [](const std::vector<ArgumentDescription> &arguments) {
-    std::vector<ValueKind> list;
-    list.reserve(arguments.size());
-    for (const ArgumentDescription &argument : arguments) list.push_back(argument.kind);
-    return list;
-  };
-  ASSERT_EQ(operations.size(), rows.size());
-  for (std::size_t i = 0; i < rows.size(); ++i) {
-    EXPECT_EQ(operations[i].name, rows[i].name);
-    EXPECT_EQ(kinds(operations[i].arguments), rows[i].arguments) << rows[i].name;
-    EXPECT_EQ(kinds(operations[i].replies), rows[i].replies) << rows[i].name;
-  }
+  expectRows(_KTStorixVendorProtocol().description(), rows);
 }
 
 TEST(KTStorixExtensionHostContext, TheVendorProtocolHasItsWordsForTheWire) {

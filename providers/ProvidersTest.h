@@ -16,6 +16,29 @@
 
 namespace storix {
 
+/// What a row of a protocol must say of an operation.
+struct ExpectedRow {
+  std::string_view name;
+  std::vector<ValueKind> arguments;
+  std::vector<ValueKind> replies;
+};
+
+/// Whether the protocol has these operations, in this order, and no others.
+inline void expectRows(const ProtocolDescription &protocol, const std::vector<ExpectedRow> &rows) {
+  const auto kinds = [](const std::vector<ArgumentDescription> &arguments) {
+    std::vector<ValueKind> list;
+    list.reserve(arguments.size());
+    for (const ArgumentDescription &argument : arguments) list.push_back(argument.kind);
+    return list;
+  };
+  ASSERT_EQ(protocol.operations.size(), rows.size());
+  for (std::size_t i = 0; i < rows.size(); ++i) {
+    EXPECT_EQ(protocol.operations[i].name, rows[i].name);
+    EXPECT_EQ(kinds(protocol.operations[i].arguments), rows[i].arguments) << rows[i].name;
+    EXPECT_EQ(kinds(protocol.operations[i].replies), rows[i].replies) << rows[i].name;
+  }
+}
+
 /// The operations of a protocol as they stand on the wire, a line each: "Method(argument) -> (reply)".
 inline std::string words(const ProtocolDescription &protocol) {
   const auto list = [](const std::vector<ArgumentDescription> &arguments) {

@@ -98,14 +98,9 @@ TEST_F(SXLinkServicerTest, TheSandboxCheckOfAGoneConnectionOrAnAbsentURLIsAskedA
 }
 
 TEST(SXDaemonProtocol, HasItsNineOperationsInOrder) {
-  struct Row {
-    std::string_view name;
-    std::vector<ValueKind> arguments;
-    std::vector<ValueKind> replies;
-  };
   using enum ValueKind;
   const auto url = ValueKind::URL;
-  const std::vector<Row> rows{
+  const std::vector<ExpectedRow> rows{
       {"wakeUpCompletion:", {}, {}},
       {"extendSandboxForFileURL:fromProviderID:toConsumerID:completionHandler:",
        {url, string, string},
@@ -120,19 +115,7 @@ TEST(SXDaemonProtocol, HasItsNineOperationsInOrder) {
       {"bookmarkableStringFromDocumentURL:completion:", {url}, {string, error}},
       {"documentURLFromBookmarkableString:completion:", {string}, {url, data, url, data, error}},
   };
-  const std::vector<OperationDescription> &operations = SXDaemonProtocol().description().operations;
-  const auto kinds = [](const std::vector<ArgumentDescription> &arguments) {
-    std::vector<ValueKind> list;
-    list.reserve(arguments.size());
-    for (const ArgumentDescription &argument : arguments) list.push_back(argument.kind);
-    return list;
-  };
-  ASSERT_EQ(operations.size(), rows.size());
-  for (std::size_t i = 0; i < rows.size(); ++i) {
-    EXPECT_EQ(operations[i].name, rows[i].name);
-    EXPECT_EQ(kinds(operations[i].arguments), rows[i].arguments) << rows[i].name;
-    EXPECT_EQ(kinds(operations[i].replies), rows[i].replies) << rows[i].name;
-  }
+  expectRows(SXDaemonProtocol().description(), rows);
 }
 
 TEST(SXDaemonProtocol, HasItsWordsForTheWire) {
