@@ -1,6 +1,5 @@
 #pragma once
 
-#include <chrono>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -11,39 +10,11 @@
 #include "platform/SXError.h"
 #include "platform/URL.h"
 #include "platform/Value.h"
+#include "storix/ClientOptions.h"
+#include "storix/FileClaim.h"
 #include "wire/UniqueFd.h"
 
 namespace storix {
-
-struct ClientOptions {
-  /// The directory of the daemon's sockets. Without one: STORIX_RUNTIME_DIR, else "storix" below
-  /// XDG_RUNTIME_DIR.
-  std::optional<std::string> runtimeDirectory;
-  /// How long a request may take. One that the daemon has not answered by then fails with `timedOut`;
-  /// the daemon may carry it out all the same.
-  std::chrono::milliseconds timeout{60'000};
-};
-
-/// What went wrong between this process and the daemon. What the daemon itself answers has other
-/// domains (`storixErrorDomain`, `posixErrorDomain`, a provider's own).
-inline constexpr std::string_view clientErrorDomain = "com.tessel.storix.client";
-
-/// Codes in `clientErrorDomain`. Every one comes with a sentence for people (`SXError::message`).
-enum class ClientErrorCode : std::int64_t {
-  /// Nobody listens on the daemon's socket, or there is no runtime directory.
-  notReachable = 1,
-  /// The connection ended before the answer came. The request may have been carried out.
-  connectionLost = 2,
-  timedOut = 3,
-  /// A D-Bus error: the request was not understood, not permitted to this process, or too big. Detail
-  /// "name" is the error's name.
-  refused = 4,
-  /// The answer lacks what it should hold: a token that could not be issued, for instance.
-  incompleteAnswer = 5,
-};
-
-/// Whether an error is of `clientErrorDomain` and has that code.
-[[nodiscard]] bool isClientError(const SXError &error, ClientErrorCode code);
 
 struct ProviderDescription {
   std::string identifier;
@@ -58,6 +29,16 @@ struct GrantedDocument {
   std::optional<Data> token;
   std::optional<URL> companionURL;
   std::optional<Data> companionToken;
+};
+
+/// A document that was opened from its bookmarkable string.
+struct OpenedDocument {
+  GrantedDocument document;
+  /// Open for reading and writing.
+  UniqueFd descriptor;
+  /// Held when it was opened for writing: end it when all is written, so that the provider hears of
+  /// the change. Nothing when it was opened for reading.
+  FileClaim claim;
 };
 
 /// An application's side of the document broker. Make one and keep it: it connects when the first
@@ -156,6 +137,21 @@ class Client {
   /// As `open` for the document's token, or its companion's; `incompleteAnswer` where there is none.
   [[nodiscard]] Result<UniqueFd> openDocument(const GrantedDocument &document);
   [[nodiscard]] Result<UniqueFd> openCompanion(const GrantedDocument &document);
+
+  /// Opens the document that a bookmarkable string names, in one call: resolves it, claims the file for
+  /// reading, so that its provider puts the content there, opens it, and ends the claim. Whoever writes
+  /// it in place later changes it under the descriptor; one who replaces it does not. The deadline is
+  /// for all of it; without one: the timeout of the client's options. Errors: those of
+  /// `resolveBookmark`, of `FileCoordinator`, and of `open`.
+  void openDocument(const std::string &bookmarkableString, ClaimOptions options, Handler<OpenedDocument> handler);
+  [[nodiscard]] Result<OpenedDocument> openDocument(const std::string &bookmarkableString, ClaimOptions options = {});
+
+  /// As `openDocument`, and then claims the file for writing before it is opened: nobody else who
+  /// coordinates reads or writes it until the claim in the answer ends.
+  void openDocumentForWriting(const std::string &bookmarkableString, ClaimOptions options,
+                              Handler<OpenedDocument> handler);
+  [[nodiscard]] Result<OpenedDocument> openDocumentForWriting(const std::string &bookmarkableString,
+                                                              ClaimOptions options = {});
 
   /// Shows the daemon a descriptor that is open for writing, so that it knows that this process may
   /// write that file; it counts as long as this client is connected. The descriptor stays the
