@@ -6,8 +6,6 @@ namespace storix {
 
 namespace {
 
-constexpr std::string_view allowedItemIDsKey = "AllowedItemIDs";
-
 // The code of "this file does not hold what it should" in the domain of files.
 constexpr std::int64_t wrongShapeCode = 1;
 

@@ -2,6 +2,7 @@
 
 #include <optional>
 #include <string>
+#include <string_view>
 #include <unordered_map>
 #include <unordered_set>
 
@@ -10,12 +11,19 @@
 
 namespace storix {
 
+/// Where the file with the grants lies: this directory below the user's home, and the name in it.
+inline constexpr std::string_view accessControlDirectory = "Library/Storix";
+inline constexpr std::string_view accessControlFileName = "AccessControl.kvs";
+
 /// The grants: provider identifier -> consumer identifier -> "AllowedItemIDs" -> ordered list of
 /// items. The dictionary is kept as the file has it, with the order of the lists and the keys that
 /// nobody here knows; beside it stands an index, so that a question costs the same however many
 /// grants there are and however they are spread. Not thread-safe: the store guards it.
 class AccessControlMap {
  public:
+  /// The key of a consumer's list.
+  static constexpr std::string_view allowedItemIDsKey = "AllowedItemIDs";
+
   AccessControlMap() = default;
 
   /// The map that was read from a file; an error that says where, if it has another shape.

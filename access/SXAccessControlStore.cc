@@ -19,14 +19,14 @@ struct AccessControlFile {
 // Works out where the file is and makes its directory, once per process.
 std::shared_ptr<AccessControlFile> locateAccessControlFile() {
   PlatformServices &platform = ProcessScope::current().platform();
-  const std::string directory = stringByAppendingPathComponent(platform.homeDirectory(), "Library/Storix");
+  const std::string directory = stringByAppendingPathComponent(platform.homeDirectory(), accessControlDirectory);
   if (!platform.fileExists(directory)) {
     if (const std::optional<SXError> error = platform.createDirectory(directory, true)) {
       sx_default_log().fault("[ERROR] Cannot create access control directory. Error: %@", *error);
     }
   }
   return std::make_shared<AccessControlFile>(
-      AccessControlFile{stringByAppendingPathComponent(directory, "AccessControl.kvs")});
+      AccessControlFile{stringByAppendingPathComponent(directory, accessControlFileName)});
 }
 
 const std::string &accessControlFilePath() {

@@ -1,10 +1,10 @@
 #include "tools/storixctl/Arguments.h"
 
-#include <algorithm>
 #include <cctype>
 #include <cerrno>
 #include <charconv>
 #include <cmath>
+#include <utility>
 
 #include "platform/SXError.h"
 
@@ -13,19 +13,6 @@ namespace storix::ctl {
 namespace {
 
 constexpr double longestTimeout = 86'400;
-
-const OperandDescription document{"DOCUMENT", "the document: a path, or a file:// URL"};
-const OperandDescription provider{"PROVIDER", "identifier of the provider"};
-const OperandDescription consumer{"CONSUMER", "bundle identifier of the application that gets the document"};
-
-constexpr std::string_view whoMayAsk =
-    "Needs the entitlement \"com.tessel.storix.acl-read\" or \"com.tessel.storix.acl-write\".\n";
-
-const VerbDescription *verbNamed(std::string_view name) {
-  const auto all = verbs();
-  const auto found = std::find_if(all.begin(), all.end(), [name](const auto &verb) { return verb.name == name; });
-  return found == all.end() ? nullptr : &*found;
-}
 
 std::optional<std::chrono::milliseconds> timeoutFrom(std::string_view text) {
   double seconds = 0;
@@ -45,10 +32,25 @@ std::string padded(std::string_view text, std::size_t width) {
   return "  " + std::string(text) + std::string(text.size() < width ? width - text.size() : 1, ' ');
 }
 
-constexpr std::string_view commonOptions =
-    "  --json               print one JSON object, also for a failure\n"
-    "  --timeout SECONDS    how long to wait for an answer (60; fractions allowed)\n"
-    "  --help               print this help\n";
+std::string optionLine(const OptionDescription &option) {
+  std::string names(option.name);
+  if (!option.value.empty()) names += " " + std::string(option.value);
+  return padded(names, 21) + std::string(option.meaning) + "\n";
+}
+
+/// The options of a verb, its own first; without one those of every verb.
+std::string optionLines(const VerbDescription *verb) {
+  std::string own;
+  std::string common;
+  for (const OptionDescription &option : options()) {
+    if (isCommon(option.option)) {
+      common += optionLine(option);
+    } else if (verb && verb->takes(option.option)) {
+      own += optionLine(option);
+    }
+  }
+  return own + common;
+}
 
 constexpr std::string_view exitStatuses =
     "Exit status:\n"
@@ -82,6 +84,28 @@ class OptionReader {
   std::optional<std::string> inlineValue_;
 };
 
+/// Takes one option into the invocation.
+std::optional<UsageError> take(const OptionDescription &known, OptionReader &option, Invocation &invocation,
+                               bool &help) {
+  if (known.value.empty()) {
+    if (option.hasInlineValue()) return UsageError{option.name + " takes no value"};
+    (known.option == Option::json ? invocation.json : help) = true;
+    return std::nullopt;
+  }
+  auto value = option.value();
+  if (known.option == Option::timeout) {
+    const auto timeout = value ? timeoutFrom(*value) : std::nullopt;
+    if (!timeout) return UsageError{"--timeout needs a number of seconds, from 0.001 to 86400"};
+    invocation.timeout = *timeout;
+    return std::nullopt;
+  }
+  if (!value || value->empty()) {
+    return UsageError{option.name + (known.value == "FILE" ? " needs the name of a file" : " needs an identifier")};
+  }
+  invocation.values.insert_or_assign(known.option, *std::move(value));
+  return std::nullopt;
+}
+
 UsageError wrongOperandCount(const VerbDescription &verb) {
   std::string names;
   for (const auto &operand : verb.operands) names += (names.empty() ? "" : " ") + std::string(operand.name);
@@ -90,64 +114,9 @@ UsageError wrongOperandCount(const VerbDescription &verb) {
 
 }  // namespace
 
-std::span<const VerbDescription> verbs() {
-  static const std::vector<VerbDescription> all{
-      {Verb::wake,
-       "wake",
-       "have the daemon answer",
-       "Starts the daemon where it is started on demand. Prints nothing.\n",
-       {}},
-      {Verb::providers,
-       "providers",
-       "list the document providers",
-       "Prints one line for each provider: its identifier, a tab, the directory where its\ndocuments appear.\n",
-       {}},
-      {Verb::extend,
-       "extend",
-       "grant a document to an application",
-       "Records the grant and prints the tokens that open the document and its companion file.\n"
-       "Needs the entitlement \"com.tessel.storix.acl-write\".\n",
-       {document, provider, consumer}},
-      {Verb::placeholder,
-       "placeholder",
-       "have the placeholder of a document made",
-       whoMayAsk,
-       {document, provider, consumer}},
-      {Verb::start,
-       "start",
-       "have a document downloaded",
-       "Returns when the document is there. The application must have been granted it.\n",
-       {document, provider, consumer}},
-      {Verb::stop,
-       "stop",
-       "tell the provider that a document is not needed any more",
-       whoMayAsk,
-       {document, provider, consumer}},
-      {Verb::open,
-       "open",
-       "print the content of a document that a token opens",
-       "With --json the content goes to the file that --output names, and its size is printed.\n",
-       {{"TOKEN", "a token as extend and resolve print it"}},
-       true},
-      {Verb::share,
-       "share",
-       "grant a document you can write to another application",
-       "Prints the bookmarkable string that the application resolves.\n",
-       {document, consumer}},
-      {Verb::bookmark, "bookmark", "print the bookmarkable string of a document", "Grants nothing.\n", {document}},
-      {Verb::resolve,
-       "resolve",
-       "find the document that a bookmarkable string names",
-       "Prints its URL and the tokens that open it. The document must have been granted to this\nprogram. There is no "
-       "answer when the provider is not installed.\n",
-       {{"STRING", "a bookmarkable string, \"storix:PROVIDER/ITEM\""}}},
-      {Verb::notify,
-       "notify",
-       "post a system notification",
-       "Prints nothing.\n",
-       {{"NAME", "the notification's name, such as com.tessel.mobile.vaultkeepd.first_unlock"}}},
-  };
-  return all;
+const std::string *Invocation::value(Option option) const {
+  const auto found = values.find(option);
+  return found == values.end() ? nullptr : &found->second;
 }
 
 ParsedArguments parseArguments(const std::vector<std::string> &arguments) {
@@ -170,29 +139,18 @@ ParsedArguments parseArguments(const std::vector<std::string> &arguments) {
       continue;
     }
     OptionReader option(arguments, i);
-    if (option.name == "--help" || option.name == "-h" || option.name == "--json") {
-      if (option.hasInlineValue()) return UsageError{option.name + " takes no value"};
-      (option.name == "--json" ? invocation.json : help) = true;
-    } else if (option.name == "--timeout") {
-      const auto value = option.value();
-      const auto timeout = value ? timeoutFrom(*value) : std::nullopt;
-      if (!timeout) return UsageError{"--timeout needs a number of seconds, from 0.001 to 86400"};
-      invocation.timeout = *timeout;
-    } else if (option.name == "--output" || option.name == "-o") {
-      invocation.output = option.value();
-      if (!invocation.output || invocation.output->empty())
-        return UsageError{option.name + " needs the name of a file"};
-    } else {
-      return UsageError{"there is no option " + option.name};
-    }
+    const OptionDescription *known = optionNamed(option.name);
+    if (!known) return UsageError{"there is no option " + option.name};
+    if (const auto error = take(*known, option, invocation, help)) return *error;
   }
   if (help) return HelpRequest{invocation.verb};
   if (!invocation.verb) return UsageError{"a verb is needed"};
   if (invocation.operands.size() != invocation.verb->operands.size()) return wrongOperandCount(*invocation.verb);
-  if (invocation.output && !invocation.verb->takesOutput) {
-    return UsageError{"\"" + std::string(invocation.verb->name) + "\" takes no --output"};
+  for (const OptionDescription &option : options()) {
+    if (!invocation.value(option.option) || invocation.verb->takes(option.option)) continue;
+    return UsageError{"\"" + std::string(invocation.verb->name) + "\" takes no " + std::string(option.name)};
   }
-  if (invocation.verb->takesOutput && invocation.json && !invocation.output) {
+  if (invocation.verb->takes(Option::output) && invocation.json && !invocation.value(Option::output)) {
     return UsageError{"\"" + std::string(invocation.verb->name) + "\" with --json needs --output"};
   }
   return invocation;
@@ -202,7 +160,7 @@ std::string helpText(const HelpRequest &request) {
   if (!request.verb) {
     std::string text = "Usage: storixctl VERB [OPTION...] [OPERAND...]\n\nAsks the document broker.\n\nVerbs:\n";
     for (const auto &verb : verbs()) text += padded(verb.name, 13) + std::string(verb.summary) + "\n";
-    text += "\nOptions:\n" + std::string(commonOptions);
+    text += "\nOptions:\n" + optionLines(nullptr);
     text += "\n\"storixctl VERB --help\" tells more about a verb. Errors are printed on standard error.\n\n";
     return text + std::string(exitStatuses);
   }
@@ -213,9 +171,7 @@ std::string helpText(const HelpRequest &request) {
   text[firstLetter] = static_cast<char>(std::toupper(static_cast<unsigned char>(text[firstLetter])));
   if (!verb.operands.empty()) text += "\nOperands:\n";
   for (const auto &operand : verb.operands) text += padded(operand.name, 13) + std::string(operand.meaning) + "\n";
-  text += "\nOptions:\n";
-  if (verb.takesOutput) text += "  --output FILE        where the content goes, instead of standard output\n";
-  return text + std::string(commonOptions) + "\n" + std::string(exitStatuses);
+  return text + "\nOptions:\n" + optionLines(&verb) + "\n" + std::string(exitStatuses);
 }
 
 Result<URL> documentURL(std::string_view operand, const std::string &currentDirectory) {

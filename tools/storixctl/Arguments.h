@@ -1,8 +1,8 @@
 #pragma once
 
 #include <chrono>
+#include <map>
 #include <optional>
-#include <span>
 #include <string>
 #include <string_view>
 #include <variant>
@@ -10,27 +10,9 @@
 
 #include "platform/Result.h"
 #include "platform/URL.h"
+#include "tools/storixctl/Verbs.h"
 
 namespace storix::ctl {
-
-enum class Verb { wake, providers, extend, placeholder, start, stop, open, share, bookmark, resolve, notify };
-
-struct OperandDescription {
-  std::string_view name;
-  std::string_view meaning;
-};
-
-struct VerbDescription {
-  Verb verb;
-  std::string_view name;
-  std::string_view summary;  ///< one line
-  std::string_view details;  ///< what it needs and what it prints
-  std::vector<OperandDescription> operands;
-  bool takesOutput = false;
-};
-
-/// All verbs, in the order of the help.
-std::span<const VerbDescription> verbs();
 
 /// One call of the program, understood. Operands are as many as the verb takes.
 struct Invocation {
@@ -38,7 +20,11 @@ struct Invocation {
   std::vector<std::string> operands;
   bool json = false;
   std::chrono::milliseconds timeout{60'000};
-  std::optional<std::string> output;
+  /// Of the options that have one and are not common to all verbs.
+  std::map<Option, std::string> values;
+
+  /// Null when the option was not given.
+  [[nodiscard]] const std::string *value(Option option) const;
 };
 
 /// Help was asked for: of one verb, or of the program.

@@ -8,6 +8,7 @@ namespace {
 
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
+using ::testing::Pair;
 
 Invocation understood(const std::vector<std::string> &arguments) {
   const auto parsed = parseArguments(arguments);
@@ -45,10 +46,14 @@ TEST(Arguments, AfterTwoDashesNothingIsAnOption) {
   EXPECT_THAT(understood({"bookmark", ""}).operands, ElementsAre(""));
 }
 
-TEST(Arguments, OutputIsForOpenAlone) {
-  EXPECT_EQ(understood({"open", "dG9rZW4=", "--output", "copy"}).output, "copy");
-  EXPECT_EQ(understood({"open", "-o", "copy", "dG9rZW4="}).output, "copy");
+TEST(Arguments, OnlyWhatAVerbTakesMayBeGiven) {
+  EXPECT_THAT(understood({"open", "dG9rZW4=", "--output", "copy"}).values, ElementsAre(Pair(Option::output, "copy")));
+  EXPECT_THAT(understood({"open", "-o", "copy", "dG9rZW4="}).values, ElementsAre(Pair(Option::output, "copy")));
+  EXPECT_THAT(understood({"grants", "--provider=a", "--consumer", "b"}).values,
+              ElementsAre(Pair(Option::provider, "a"), Pair(Option::consumer, "b")));
   EXPECT_EQ(complaint({"wake", "--output=x"}), "\"wake\" takes no --output");
+  EXPECT_EQ(complaint({"providers", "--provider=x"}), "\"providers\" takes no --provider");
+  EXPECT_EQ(complaint({"grants", "--provider"}), "--provider needs an identifier");
   EXPECT_EQ(complaint({"open", "dG9rZW4=", "--output="}), "--output needs the name of a file");
   EXPECT_EQ(complaint({"open", "dG9rZW4=", "--json"}), "\"open\" with --json needs --output");
 }
@@ -88,7 +93,10 @@ TEST(Arguments, HelpOfAVerbNeedsNoOperandsAndNamesThem) {
     const std::string text = helpText(std::get<HelpRequest>(parsed));
     EXPECT_THAT(text, HasSubstr("storixctl " + std::string(verb.name)));
     for (const auto &operand : verb.operands) EXPECT_THAT(text, HasSubstr("  " + std::string(operand.name) + " "));
-    EXPECT_EQ(text.find("--output") != std::string::npos, verb.takesOutput) << verb.name;
+    for (const auto &option : options()) {
+      EXPECT_EQ(text.find("\n  " + std::string(option.name) + " ") != std::string::npos, verb.takes(option.option))
+          << verb.name << option.name;
+    }
   }
 }
 

@@ -10,66 +10,14 @@
 #include <ostream>
 #include <utility>
 
+#include "tools/storixctl/Grants.h"
 #include "tools/storixctl/Json.h"
+#include "tools/storixctl/Printed.h"
+#include "tools/storixctl/Requests.h"
 
 namespace storix::ctl {
 
 namespace {
-
-/// What a verb gives: the same thing for programs and for people.
-struct Printed {
-  Dictionary json;
-  std::string text;
-};
-
-/// Names and paths come from elsewhere and could hold what a terminal obeys.
-std::string printable(std::string text) {
-  std::replace_if(
-      text.begin(), text.end(), [](char c) { return (c >= 0 && c < ' ') || c == 0x7f; }, '?');
-  return text;
-}
-
-Result<Printed> outcome(const std::optional<SXError> &error) {
-  if (error) return *error;
-  return Printed{{{"done", true}}, ""};
-}
-
-Result<Printed> bookmarkableString(const std::string &string) {
-  return Printed{{{"bookmarkableString", string}}, printable(string) + "\n"};
-}
-
-Result<Printed> grantedDocument(const Result<GrantedDocument> &granted) {
-  if (!granted) return granted.error();
-  const GrantedDocument &document = granted.value();
-  Printed printed{{{"URL", document.url}}, "URL              " + document.url.absoluteString() + "\n"};
-  if (document.token) {
-    printed.json.emplace("token", *document.token);
-    printed.text += "token            " + base64(*document.token) + "\n";
-  }
-  if (document.companionURL) {
-    printed.json.emplace("companionURL", *document.companionURL);
-    printed.text += "companion URL    " + document.companionURL->absoluteString() + "\n";
-  }
-  if (document.companionToken) {
-    printed.json.emplace("companionToken", *document.companionToken);
-    printed.text += "companion token  " + base64(*document.companionToken) + "\n";
-  }
-  return printed;
-}
-
-Result<Printed> providerList(const Result<std::vector<ProviderDescription>> &providers) {
-  if (!providers) return providers.error();
-  List list;
-  std::string text;
-  for (const ProviderDescription &provider : providers.value()) {
-    Dictionary entry{{"identifier", provider.identifier}};
-    if (provider.documentStorageURL) entry.emplace("documentStorageURL", *provider.documentStorageURL);
-    list.emplace_back(std::move(entry));
-    const std::string directory = provider.documentStorageURL ? provider.documentStorageURL->path() : "";
-    text += printable(provider.identifier) + "\t" + printable(directory) + "\n";
-  }
-  return Printed{{{"providers", std::move(list)}}, std::move(text)};
-}
 
 /// Copies everything from the descriptor's beginning. The number of bytes, or what failed.
 Result<std::int64_t> copyContent(int descriptor, std::ostream &to) {
@@ -92,69 +40,42 @@ Result<Printed> openDocument(const Invocation &invocation, Client &client, std::
   if (!token) return posixError(EINVAL, "reading the token: it must be base64 text, as extend and resolve print it");
   const auto opened = client.open(*token);
   if (!opened) return opened.error();
-  if (!invocation.output) {
+  const std::string *output = invocation.value(Option::output);
+  if (!output) {
     const auto copied = copyContent(opened.value().get(), out);
     if (!copied) return copied.error();
     return Printed{{}, ""};
   }
-  std::ofstream file(*invocation.output, std::ios::binary | std::ios::trunc);
-  if (!file) return posixError(errno, "opening " + *invocation.output);
+  std::ofstream file(*output, std::ios::binary | std::ios::trunc);
+  if (!file) return posixError(errno, "opening " + *output);
   const auto copied = copyContent(opened.value().get(), file);
   if (!copied) return copied.error();
-  return Printed{{{"output", *invocation.output}, {"size", copied.value()}}, ""};
+  return Printed{{{"output", *output}, {"size", copied.value()}}, ""};
 }
 
-/// The verbs that speak of a document, on behalf of a consumer or not.
-Result<Printed> documentVerb(const Invocation &invocation, Client &client, const std::string &currentDirectory) {
-  const auto &operands = invocation.operands;
-  const auto document = documentURL(operands[0], currentDirectory);
-  if (!document) return document.error();
-  const URL &url = document.value();
+Result<Printed> carryOut(const Invocation &invocation, Client &client, Surroundings &surroundings) {
   switch (invocation.verb->verb) {
-    case Verb::extend:
-      return grantedDocument(client.extendSandbox(url, operands[1], operands[2]));
-    case Verb::placeholder:
-      return outcome(client.providePlaceholder(url, operands[1], operands[2]));
-    case Verb::start:
-      return outcome(client.startProviding(url, operands[1], operands[2]));
-    case Verb::stop:
-      return outcome(client.stopProviding(url, operands[1], operands[2]));
-    case Verb::share: {
-      const auto string = client.extendBookmark(url, operands[1]);
-      return string ? bookmarkableString(string.value()) : Result<Printed>(string.error());
-    }
-    default: {
-      const auto string = client.bookmarkableString(url);
-      if (!string) return string.error();
-      if (!string.value()) return SXNotFoundErrorURL(url);
-      return bookmarkableString(*string.value());
-    }
-  }
-}
-
-Result<Printed> carryOut(const Invocation &invocation, Client &client, const std::string &currentDirectory,
-                         std::ostream &out) {
-  switch (invocation.verb->verb) {
-    case Verb::wake:
-      return outcome(client.wakeUp());
-    case Verb::providers:
-      return providerList(client.providers());
     case Verb::open:
-      return openDocument(invocation, client, out);
-    case Verb::resolve:
-      return grantedDocument(client.resolveBookmark(invocation.operands[0]));
-    case Verb::notify:
-      return outcome(client.postNotification(invocation.operands[0]));
+      return openDocument(invocation, client, surroundings.out);
+    case Verb::grants:
+      return grants(invocation, surroundings.homeDirectory, surroundings.outputIsTerminal);
     default:
-      return documentVerb(invocation, client, currentDirectory);
+      return request(invocation, client, surroundings);
   }
 }
 
 }  // namespace
 
-ExitStatus runCommand(const Invocation &invocation, Client &client, const std::string &currentDirectory,
-                      std::ostream &out, std::ostream &err) {
-  const auto printed = carryOut(invocation, client, currentDirectory, out);
+std::string printable(std::string text) {
+  std::replace_if(
+      text.begin(), text.end(), [](char c) { return (c >= 0 && c < ' ') || c == 0x7f; }, '?');
+  return text;
+}
+
+ExitStatus runCommand(const Invocation &invocation, Client &client, Surroundings &surroundings) {
+  std::ostream &out = surroundings.out;
+  std::ostream &err = surroundings.err;
+  const auto printed = carryOut(invocation, client, surroundings);
   if (!printed) {
     if (invocation.json) out << jsonText({{"error", printed.error()}}) << std::flush;
     err << "storixctl: " << invocation.verb->name << ": " << errorLine(printed.error()) << std::endl;

@@ -1,10 +1,10 @@
 #pragma once
 
-#include <iosfwd>
 #include <string>
 
 #include "storix/Client.h"
 #include "tools/storixctl/Arguments.h"
+#include "tools/storixctl/Surroundings.h"
 
 namespace storix::ctl {
 
@@ -12,8 +12,7 @@ enum ExitStatus : int { done = 0, requestFailed = 1, notUnderstood = 2, daemonNo
 
 /// Carries out one call of the program and prints its result on `out`, an error for people on `err`,
 /// and with --json the error on `out` as well.
-ExitStatus runCommand(const Invocation &invocation, Client &client, const std::string &currentDirectory,
-                      std::ostream &out, std::ostream &err);
+ExitStatus runCommand(const Invocation &invocation, Client &client, Surroundings &surroundings);
 
 /// Whether it is the daemon that cannot be reached, or the request that failed.
 ExitStatus exitStatusOf(const SXError &error);

@@ -24,7 +24,7 @@ class CommandsTest : public ::testing::Test {
     out_.str("");
     err_.str("");
     Client client({daemon_.directory(), timeout});
-    return runCommand(std::get<Invocation>(parseArguments(arguments)), client, "/storage", out_, err_);
+    return runCommand(std::get<Invocation>(parseArguments(arguments)), client, surroundings_);
   }
   std::shared_ptr<sdk::ScriptedDaemon> scripted() { return daemon_.daemon; }
   std::string printed() const { return out_.str(); }
@@ -33,6 +33,7 @@ class CommandsTest : public ::testing::Test {
   sdk::TestDaemon daemon_;
   std::ostringstream out_;
   std::ostringstream err_;
+  Surroundings surroundings_{"/storage", "", out_, err_};
 };
 
 TEST_F(CommandsTest, WakePrintsNothing) {
@@ -53,6 +54,9 @@ TEST_F(CommandsTest, ProvidersAreOneLineEach) {
   };
   EXPECT_EQ(run({"providers"}), done);
   EXPECT_EQ(printed(), "org.sample.broken\t\norg.sample.docs\t/a b?[2J\n");
+  surroundings_.outputIsTerminal = true;
+  EXPECT_EQ(run({"providers"}), done);
+  EXPECT_EQ(printed(), "PROVIDER           DOCUMENTS\norg.sample.broken\norg.sample.docs    /a b?[2J\n");
   EXPECT_EQ(run({"providers", "--json"}), done);
   EXPECT_THAT(printed(), HasSubstr("\"documentStorageURL\": \"file:///a%20b%1B%5B2J/\""));
 }
@@ -107,7 +111,7 @@ TEST_F(CommandsTest, NoAnswerInTimeIsStatusThree) {
 
 TEST_F(CommandsTest, NoDaemonIsStatusThree) {
   Client client({daemon_.directory() + "/nowhere", std::chrono::seconds(60)});
-  EXPECT_EQ(runCommand(std::get<Invocation>(parseArguments({"wake", "--json"})), client, "/", out_, err_),
+  EXPECT_EQ(runCommand(std::get<Invocation>(parseArguments({"wake", "--json"})), client, surroundings_),
             daemonNotReachable);
   EXPECT_THAT(complaint(), HasSubstr("not running"));
   EXPECT_THAT(printed(), HasSubstr("\"domain\": \"com.tessel.storix.client\""));
@@ -177,7 +181,7 @@ TEST_F(CommandsTest, AResultThatCannotBeWrittenIsAFailure) {
   scripted()->onProviders = [](const SXDaemon::ProvidersReply &reply) { reply(std::nullopt, Dictionary{}); };
   Client client({daemon_.directory(), std::chrono::seconds(60)});
   out_.setstate(std::ios::badbit);
-  EXPECT_EQ(runCommand(std::get<Invocation>(parseArguments({"providers"})), client, "/", out_, err_), requestFailed);
+  EXPECT_EQ(runCommand(std::get<Invocation>(parseArguments({"providers"})), client, surroundings_), requestFailed);
   EXPECT_THAT(complaint(), HasSubstr("could not be written"));
 }
 

@@ -1,4 +1,7 @@
-#include <cerrno>
+#include <unistd.h>
+
+#include <clocale>
+#include <cstdlib>
 #include <filesystem>
 #include <iostream>
 #include <string>
@@ -12,6 +15,7 @@
 
 int main(int count, char **values) {
   using namespace storix::ctl;
+  (void)std::setlocale(LC_CTYPE, "");
   const std::vector<std::string> arguments(values + (count > 0 ? 1 : 0), values + count);
   const ParsedArguments parsed = parseArguments(arguments);
   if (const auto *help = std::get_if<HelpRequest>(&parsed)) {
@@ -25,8 +29,10 @@ int main(int count, char **values) {
   const auto &invocation = std::get<Invocation>(parsed);
   std::error_code unknown;
   const std::string currentDirectory = std::filesystem::current_path(unknown).string();
+  const char *home = std::getenv("HOME");
+  Surroundings surroundings{currentDirectory, home ? home : "", std::cout, std::cerr, ::isatty(STDOUT_FILENO) == 1};
   storix::ClientOptions options;
   options.timeout = invocation.timeout;
   storix::Client client(options);
-  return runCommand(invocation, client, currentDirectory, std::cout, std::cerr);
+  return runCommand(invocation, client, surroundings);
 }
