@@ -101,7 +101,7 @@ TEST(AccessControlMap, FindsTheOthersAfterARemoval) {
 }
 
 TEST(AccessControlMap, ContentOfAnotherShapeIsAnErrorThatSaysWhere) {
-  EXPECT_THAT(reasonFor(List{}), HasSubstr("a list at the top where a dictionary should be"));
+  EXPECT_EQ(reasonFor(List{}), "The access control file has a list at the top where a dictionary should be.");
   EXPECT_THAT(reasonFor(Dictionary{{"p", "x"}}), HasSubstr("a string for provider “p” where a dictionary"));
   EXPECT_THAT(reasonFor(Dictionary{{"p", Dictionary{{"c", List{}}}}}),
               HasSubstr("a list for consumer “c” of provider “p” where a dictionary"));
@@ -109,6 +109,9 @@ TEST(AccessControlMap, ContentOfAnotherShapeIsAnErrorThatSaysWhere) {
               HasSubstr("a dictionary as AllowedItemIDs for consumer “c” of provider “p” where a list"));
   EXPECT_THAT(reasonFor(Dictionary{{"p", Dictionary{{"c", entry({"i", 5})}}}}),
               HasSubstr("a number as item 1 of AllowedItemIDs for consumer “c” of provider “p” where a string"));
+  const SXError error = AccessControlMap::fromValue(List{}).error();
+  EXPECT_EQ(error.domain(), filesErrorDomain);
+  EXPECT_EQ(error.code(), 1);
 }
 
 }  // namespace

@@ -276,9 +276,10 @@ using SXAccessControlStoreDeathTest = SXAccessControlStoreTest;
 
 TEST_F(SXAccessControlStoreDeathTest, AllowingWithAnAbsentIdentifierEndsTheProcess) {
   store();
-  EXPECT_DEATH(store()->allowProviderWithIdentifier(std::nullopt, "i", "c"), "programming error");
-  EXPECT_DEATH(store()->allowProviderWithIdentifier("p", std::nullopt, "c"), "programming error");
-  EXPECT_DEATH(store()->allowProviderWithIdentifier("p", "i", std::nullopt), "programming error");
+  const char *message = "programming error.*a grant needs a provider, an item and a consumer";
+  EXPECT_DEATH(store()->allowProviderWithIdentifier(std::nullopt, "i", "c"), message);
+  EXPECT_DEATH(store()->allowProviderWithIdentifier("p", std::nullopt, "c"), message);
+  EXPECT_DEATH(store()->allowProviderWithIdentifier("p", "i", std::nullopt), message);
 }
 
 class ThreadedAccessControlStoreTest : public fake::FakeHostTest {

@@ -72,12 +72,6 @@ class ProviderRegistryTest : public ProvidersTest {
   static constexpr const char *refresh = "log info [INFO] Updating provider list.";
 };
 
-std::vector<std::string> joined(std::initializer_list<std::vector<std::string>> parts) {
-  std::vector<std::string> all;
-  for (const std::vector<std::string> &part : parts) all.insert(all.end(), part.begin(), part.end());
-  return all;
-}
-
 TEST_F(ProviderRegistryTest, TheFirstRefreshMakesAndRegistersEachProviderAndThenCompletes) {
   install("org.b");
   install("org.a");
@@ -258,6 +252,15 @@ TEST_F(ProviderRegistryTest, ProvidersOfAListAreRegisteredEvenByHand) {
   EXPECT_EQ(trace().back(), "registered () on queue global queue");
   SXExtensionStorix::refreshOperationsQueueRegisterProviders({}, {});
   EXPECT_FALSE(platform().runOne());
+}
+
+TEST_F(ProviderRegistryTest, AnEmptyListIsCompletedLaterOnTheGlobalQueue) {
+  SXExtensionStorix::refreshOperationsQueueRegisterProviders({}, {});
+  trace();
+  SXExtensionStorix::refreshOperationsQueueRegisterProviders({}, recordingCompletion("registered"));
+  EXPECT_THAT(trace(), IsEmpty());
+  runUntilIdle();
+  EXPECT_THAT(trace(), ElementsAre("registered () on queue global queue"));
 }
 
 TEST_F(ProviderRegistryTest, AURLBelowAProvidersDirectoryIsItsOwn) {

@@ -118,6 +118,57 @@ class ProvidersTest : public fake::FakeHostTest {
   static SXError someError(const std::string &description) {
     return SXError("org.sample.errors", 7, {{"description", description}});
   }
+
+  static std::vector<std::string> joined(std::initializer_list<std::vector<std::string>> parts) {
+    std::vector<std::string> all;
+    for (const std::vector<std::string> &part : parts) all.insert(all.end(), part.begin(), part.end());
+    return all;
+  }
+
+  /// One message to a provider and its answer. Requests 1 and 2 were the registrations.
+  static std::vector<std::string> message(const std::string &operation, const std::string &provider,
+                                          const std::string &request, const std::string &name,
+                                          const std::string &subject, const std::string &answer) {
+    return {"log debug [DEBUG] -[SXExtensionStorix " + operation + "]",
+            "beginExtensionRequest " + provider + " version 1 " + request,
+            "begun " + request,
+            "log debug [DEBUG] Beginning extension request.",
+            "extensionContextForRequest " + provider + " version 1 " + request,
+            "remoteProxyWithErrorHandler " + request,
+            "send " + request + " " + name + " (" + subject + ")",
+            "answer " + request + " " + name + " " + answer};
+  }
+  static std::string cancel(const std::string &provider, const std::string &request) {
+    return "cancelExtensionRequest " + provider + " version 1 " + request;
+  }
+  /// A request to a provider that cannot be begun: `line` is the operation's own, up to the provider.
+  static std::vector<std::string> failedBegin(const std::string &operation, const std::string &provider,
+                                              const std::string &request, const std::string &line,
+                                              const SXError &error) {
+    return {"log debug [DEBUG] -[SXExtensionStorix " + operation + "]",
+            "beginExtensionRequest " + provider + " version 1 " + request,
+            "begin failed " + request + " " + text(error),
+            "log debug [DEBUG] Beginning extension request.",
+            "log fault [ERROR] Extension request failed. Error: " + text(error),
+            "log fault [ERROR] " + line + " for extension " + provider + ". Error: " + text(error)};
+  }
+  /// A provider is asked for an item's identifier, and gives it.
+  static std::vector<std::string> identification(const std::string &provider, const std::string &request,
+                                                 const URL &url) {
+    return joined({message("itemIDForURL:completionHandler:", provider, request,
+                           "_identifierForItemAtURL:completion:", url.absoluteString(), "((null), f/i)"),
+                   {"log debug [DEBUG] Successfully got item ID “f/i” for URL " + url.absoluteString() +
+                    " from extension " + provider}});
+  }
+  /// A provider is asked for an item's identifier, and answers an error; `answer` is all of its answer.
+  static std::vector<std::string> failedIdentification(const std::string &provider, const std::string &request,
+                                                       const URL &url, const std::string &answer,
+                                                       const SXError &error) {
+    return joined({message("itemIDForURL:completionHandler:", provider, request,
+                           "_identifierForItemAtURL:completion:", url.absoluteString(), answer),
+                   {"log fault [ERROR] Proxy failed to get item ID for URL " + url.absoluteString() +
+                    " for extension " + provider + ". Error: " + text(error)}});
+  }
 };
 
 }  // namespace storix

@@ -1,5 +1,9 @@
 #include "providers/SXExtensionStorix.h"
 
+#include <functional>
+#include <tuple>
+#include <vector>
+
 #include "providers/ProvidersTest.h"
 
 namespace storix {
@@ -105,21 +109,29 @@ TEST_F(SXExtensionStorixTest, SettersReturnBeforeTheValueIsStoredAndReadsAfterTh
 
 TEST_F(SXExtensionStorixTest, SettersWaitForTheReadersBeforeThem) {
   const std::shared_ptr<SXExtensionStorix> provider = make(completeProvider("org.a"));
-  bool wasRead = false;
-  provider->memberQueue()->async([this, &provider, &wasRead] {
-    // Whatever could run beside this reader runs now.
-    while (platform().runOne()) continue;
-    EXPECT_EQ(provider->memberQueueIdentifier(), "org.a");
-    EXPECT_EQ(provider->memberQueueProvidedItemsURL(), storageURL("org.a"));
-    EXPECT_EQ(provider->memberQueueExtension()->identifier(), "org.a");
-    wasRead = true;
-  });
-  provider->setIdentifier("org.b");
-  provider->setProvidedItemsURL(std::nullopt);
-  provider->setExtension(platform().extensions().makeRecord(completeProvider("org.b")));
-  runUntilIdle();
-  EXPECT_TRUE(wasRead);
-  EXPECT_EQ(provider->memberQueueIdentifier(), "org.b");
+  const std::vector<std::function<void()>> setters{
+      [&provider] { provider->setIdentifier("org.b"); },
+      [&provider] { provider->setProvidedItemsURL(std::nullopt); },
+      [this, &provider] { provider->setExtension(platform().extensions().makeRecord(completeProvider("org.b"))); },
+  };
+  const auto values = [&provider] {
+    return std::tuple(provider->memberQueueIdentifier(), provider->memberQueueProvidedItemsURL(),
+                      provider->memberQueueExtension());
+  };
+  for (const std::function<void()> &set : setters) {
+    const auto before = values();
+    bool wasRead = false;
+    provider->memberQueue()->async([this, &values, &before, &wasRead] {
+      // Whatever could run beside this reader runs now.
+      while (platform().runOne()) continue;
+      EXPECT_EQ(values(), before);
+      wasRead = true;
+    });
+    set();
+    runUntilIdle();
+    EXPECT_TRUE(wasRead);
+    EXPECT_NE(values(), before);
+  }
 }
 
 TEST_F(SXExtensionStorixTest, WithoutAnIdentifierOfItsOwnItHasThatOfTheRecord) {

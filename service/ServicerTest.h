@@ -95,37 +95,13 @@ class ServicerTest : public ProvidersTest {
   static constexpr const char *global = "queue global queue";
   static constexpr const char *platformThread = "platform thread";
 
-  static std::vector<std::string> joined(std::initializer_list<std::vector<std::string>> parts) {
-    std::vector<std::string> all;
-    for (const std::vector<std::string> &part : parts) all.insert(all.end(), part.begin(), part.end());
-    return all;
-  }
-
-  /// One message to a provider and its answer. Requests 1 and 2 were the registrations.
-  static std::vector<std::string> message(const std::string &operation, const std::string &provider,
-                                          const std::string &request, const std::string &name,
-                                          const std::string &subject, const std::string &answer) {
-    return {"log debug [DEBUG] -[SXExtensionStorix " + operation + "]",
-            "beginExtensionRequest " + provider + " version 1 " + request,
-            "begun " + request,
-            "log debug [DEBUG] Beginning extension request.",
-            "extensionContextForRequest " + provider + " version 1 " + request,
-            "remoteProxyWithErrorHandler " + request,
-            "send " + request + " " + name + " (" + subject + ")",
-            "answer " + request + " " + name + " " + answer};
-  }
-  static std::vector<std::string> identification(const std::string &provider, const std::string &request,
-                                                 const URL &url) {
-    return joined({message("itemIDForURL:completionHandler:", provider, request,
-                           "_identifierForItemAtURL:completion:", url.absoluteString(), "((null), f/i)"),
-                   {"log debug [DEBUG] Successfully got item ID “f/i” for URL " + url.absoluteString() +
-                    " from extension " + provider}});
-  }
-  static std::string cancel(const std::string &provider, const std::string &request) {
-    return "cancelExtensionRequest " + provider + " version 1 " + request;
-  }
   static std::string compared(const std::string &provider, const URL &url) {
     return "directoryRelationship " + storageText(provider) + " " + url.absoluteString();
+  }
+
+  /// The registry finds the owner of the item.
+  [[nodiscard]] std::vector<std::string> ownerFound() const {
+    return {compared("org.a", *item_), "log info [INFO] Resolved URL to provider org.a."};
   }
 
   std::shared_ptr<StoreOwner> server_;

@@ -28,15 +28,14 @@ class BookmarkableStringRequestTest : public ServicerTest {
 
 TEST_F(BookmarkableStringRequestTest, AnyClientGetsTheStringOfAnItem) {
   call(name, request(item_));
-  EXPECT_THAT(trace(),
-              ElementsAreArray(
-                  joined({start(item_),
-                          {compared("org.a", *item_), "log info [INFO] Resolved URL to provider org.a."},
-                          identification("org.a", "request-3", *item_),
-                          {"log debug [DEBUG] Successfully generated bookmarkable string "
-                           "“storix:org.a/f/i” from URL " +
-                               itemText() + ".",
-                           reply(name, "(storix:org.a/f/i, (null))", platformThread), cancel("org.a", "request-3")}})));
+  EXPECT_THAT(trace(), ElementsAreArray(joined({start(item_),
+                                                ownerFound(),
+                                                identification("org.a", "request-3", *item_),
+                                                {"log debug [DEBUG] Successfully generated bookmarkable string "
+                                                 "“storix:org.a/f/i” from URL " +
+                                                     itemText() + ".",
+                                                 reply(name, "(storix:org.a/f/i, (null))", platformThread),
+                                                 cancel("org.a", "request-3")}})));
   EXPECT_FALSE(platform().files().exists("/home/u/Library/Storix/AccessControl.kvs"));
 }
 
@@ -51,27 +50,44 @@ TEST_F(BookmarkableStringRequestTest, AURLOutsideEveryProviderGetsNeitherStringN
 }
 
 TEST_F(BookmarkableStringRequestTest, AnAbsentURLIsNobodys) {
-  const std::shared_ptr<fake::FakeReply> answered = call(name, request(std::nullopt));
-  EXPECT_EQ(answered->answer().values, (Arguments{Argument(), Argument()}));
-  EXPECT_TRUE(platform().log().contains(LogSeverity::info, "[INFO] Could not find the provider for URL (null)"));
+  call(name, request(std::nullopt));
+  std::vector<std::string> lookup;
+  for (const char *provider : {"org.a", "org.b"}) {
+    lookup.push_back("directoryRelationship " + storageText(provider) + " (null)");
+    lookup.push_back("log fault [ERROR] Cannot get the relationship between URL " + storageText(provider) +
+                     " and (null). Error: posix 22 \"Cannot compare an item without a URL: Invalid argument\"");
+  }
+  EXPECT_THAT(trace(), ElementsAreArray(joined({start(std::nullopt),
+                                                lookup,
+                                                {"log info [INFO] Could not find the provider for URL (null)",
+                                                 reply(name, "((null), (null))", global)}})));
 }
 
 TEST_F(BookmarkableStringRequestTest, TheProviderObjectsErrorIsPassedOnUnchanged) {
   const SXError error = someError("no such item");
   process("org.a").setAnswer(identify, VendorAnswer::values({Argument(error), Argument("f/i")}));
   call(name, request(item_));
-  EXPECT_EQ(platform().trace().count(
-                reply(name, "((null), " + text(SXPluginOperationFailedError(error)) + ")", platformThread)),
-            1U);
-  EXPECT_EQ(platform().trace().count("log fault"), 1U);
+  EXPECT_THAT(trace(), ElementsAreArray(joined(
+                           {start(item_),
+                            ownerFound(),
+                            failedIdentification("org.a", "request-3", *item_, "(" + text(error) + ", f/i)", error),
+                            {reply(name, "((null), " + text(SXPluginOperationFailedError(error)) + ")", platformThread),
+                             cancel("org.a", "request-3")}})));
 }
 
 TEST_F(BookmarkableStringRequestTest, NeitherIdentifierNorErrorIsAnErrorLineAndAnEmptyReply) {
   process("org.a").setAnswer(identify, VendorAnswer::values());
   call(name, request(item_));
-  EXPECT_TRUE(
-      platform().log().contains(LogSeverity::fault, "[ERROR] Could not get Item ID for URL " + itemText() + "."));
-  EXPECT_EQ(platform().trace().count(reply(name, "((null), (null))", platformThread)), 1U);
+  EXPECT_THAT(
+      trace(),
+      ElementsAreArray(joined(
+          {start(item_),
+           ownerFound(),
+           message("itemIDForURL:completionHandler:", "org.a", "request-3",
+                   "_identifierForItemAtURL:completion:", itemText(), "()"),
+           {"log debug [DEBUG] Successfully got item ID “(null)” for URL " + itemText() + " from extension org.a",
+            "log fault [ERROR] Could not get Item ID for URL " + itemText() + ".",
+            reply(name, "((null), (null))", platformThread), cancel("org.a", "request-3")}})));
 }
 
 TEST_F(BookmarkableStringRequestTest, NeedsNoReplyHandler) {

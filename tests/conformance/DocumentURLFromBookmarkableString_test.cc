@@ -25,6 +25,23 @@ class DocumentURLRequestTest : public ServicerTest {
             "log debug [DEBUG] Getting URL from bookmarkable string: “" + string + "”.", "peerAuditToken peer 100",
             "bundleIdentifierForAuditToken peer 100"};
   }
+  /// The provider is asked where the item is, and answers with `item_`, for which tokens are issued.
+  [[nodiscard]] std::vector<std::string> located(const std::string &item, const std::string &number) const {
+    const URL companion = itemURL("org.a", ".report.txt");
+    return joined({message("URLForItemID:completionHandler:", "org.a", number,
+                           "_URLForItemIdentifier:completion:", item, "((null), " + itemText() + ")"),
+                   {"log debug [DEBUG] Successfully retrieved URL " + itemText() + " for item ID “" + item +
+                        "” from extension org.a",
+                    "issueSandboxExtension readWrite " + item_->path() + " flags=0",
+                    "issueSandboxExtension readWrite " + companion.path() + " flags=0",
+                    "log info [INFO] Successfully extended sandbox of URL " + itemText() +
+                        " from provider ID org.a to consumer ID org.app.",
+                    reply(name,
+                          "(" + itemText() + ", " + token(*item_) + ", " + companion.absoluteString() + ", " +
+                              token(companion) + ", (null))",
+                          platformThread),
+                    cancel("org.a", number)}});
+  }
   static std::string failed(const SXError &error, const char *where) {
     return reply(name, "((null), (null), (null), (null), " + text(error) + ")", where);
   }
@@ -33,23 +50,8 @@ class DocumentURLRequestTest : public ServicerTest {
 TEST_F(DocumentURLRequestTest, AGrantedItemIsLocatedAndGetsTokens) {
   grant("org.a", "f/i", "org.app");
   call(name, request("storix:org.a/f/i"));
-  const URL companion = itemURL("org.a", ".report.txt");
-  EXPECT_THAT(
-      trace(),
-      ElementsAreArray(joined(
-          {start("storix:org.a/f/i"),
-           message("URLForItemID:completionHandler:", "org.a", "request-3", "_URLForItemIdentifier:completion:", "f/i",
-                   "((null), " + itemText() + ")"),
-           {"log debug [DEBUG] Successfully retrieved URL " + itemText() + " for item ID “f/i” from extension org.a",
-            "issueSandboxExtension readWrite " + item_->path() + " flags=0",
-            "issueSandboxExtension readWrite " + companion.path() + " flags=0",
-            "log info [INFO] Successfully extended sandbox of URL " + itemText() +
-                " from provider ID org.a to consumer ID org.app.",
-            reply(name,
-                  "(" + itemText() + ", " + token(*item_) + ", " + companion.absoluteString() + ", " +
-                      token(companion) + ", (null))",
-                  platformThread),
-            cancel("org.a", "request-3")}})));
+  EXPECT_THAT(trace(), ElementsAreArray(joined({start("storix:org.a/f/i"), located("f/i", "request-3")})));
+  EXPECT_EQ(platform().files().writeCount("/home/u/Library/Storix/AccessControl.kvs"), 1U);  // the grant above
 }
 
 TEST_F(DocumentURLRequestTest, ACallerWithoutBundleIsNotPermittedWhateverTheString) {
@@ -75,8 +77,9 @@ TEST_F(DocumentURLRequestTest, AMalformedStringIsInvalid) {
 }
 
 TEST_F(DocumentURLRequestTest, AnAbsentStringIsInvalid) {
-  EXPECT_EQ(call(name, request(std::nullopt))->error(4), SXInvalidBookmarkableStringError());
-  EXPECT_TRUE(platform().log().contains(LogSeverity::debug, "[DEBUG] Getting URL from bookmarkable string: “(null)”."));
+  call(name, request(std::nullopt));
+  EXPECT_THAT(trace(),
+              ElementsAreArray(joined({start("(null)"), {failed(SXInvalidBookmarkableStringError(), global)}})));
 }
 
 TEST_F(DocumentURLRequestTest, WithoutAGrantToTheCallerItIsNotPermitted) {
@@ -94,9 +97,9 @@ TEST_F(DocumentURLRequestTest, TheItemKeepsItsSlashes) {
   grant("org.a", "a/b/c", "org.app");
   grant("org.a", "a/", "org.app");
   call(name, request("storix:org.a/a/b/c"));
-  EXPECT_EQ(platform().trace().count("send request-3 _URLForItemIdentifier:completion: (a/b/c)"), 1U);
+  EXPECT_THAT(trace(), ElementsAreArray(joined({start("storix:org.a/a/b/c"), located("a/b/c", "request-3")})));
   call(name, request("storix:org.a/a/"));
-  EXPECT_EQ(platform().trace().count("send request-4 _URLForItemIdentifier:completion: (a/)"), 1U);
+  EXPECT_THAT(trace(), ElementsAreArray(joined({start("storix:org.a/a/"), located("a/", "request-4")})));
 }
 
 TEST_F(DocumentURLRequestTest, AProviderThatIsNotThereIsNeverAnswered) {
@@ -108,25 +111,33 @@ TEST_F(DocumentURLRequestTest, AProviderThatIsNotThereIsNeverAnswered) {
 
 TEST_F(DocumentURLRequestTest, AProviderThatCannotLocateTheItemIsASandboxFailure) {
   grant("org.a", "f/i", "org.app");
-  process("org.a").setAnswer(locate, VendorAnswer::values({Argument(someError("gone")), Argument(*item_)}));
+  const SXError error = someError("gone");
+  process("org.a").setAnswer(locate, VendorAnswer::values({Argument(error), Argument(*item_)}));
   call(name, request("storix:org.a/f/i"));
-  EXPECT_EQ(platform().trace().count(failed(SXSandboxExtensionFailedError(std::nullopt), platformThread)), 1U);
-  EXPECT_EQ(platform().trace().count("issueSandboxExtension"), 0U);
+  EXPECT_THAT(
+      trace(),
+      ElementsAreArray(joined(
+          {start("storix:org.a/f/i"),
+           message("URLForItemID:completionHandler:", "org.a", "request-3", "_URLForItemIdentifier:completion:", "f/i",
+                   "(" + text(error) + ", " + itemText() + ")"),
+           {"log fault [ERROR] Proxy failed to get URL for item ID “f/i” for extension org.a. Error: " + text(error),
+            failed(SXSandboxExtensionFailedError(std::nullopt), platformThread), cancel("org.a", "request-3")}})));
 }
 
 TEST_F(DocumentURLRequestTest, AProviderThatGivesNoURLIsASuccessWithNothing) {
   grant("org.a", "f/i", "org.app");
   process("org.a").setAnswer(locate, VendorAnswer::values());
-  EXPECT_EQ(call(name, request("storix:org.a/f/i"))->answer().values, Arguments(5));
-  EXPECT_TRUE(platform().log().contains(LogSeverity::info,
-                                        "[INFO] Successfully extended sandbox of URL (null) from "
-                                        "provider ID org.a to consumer ID org.app."));
-}
-
-TEST_F(DocumentURLRequestTest, NoGrantIsWritten) {
-  grant("org.a", "f/i", "org.app");
   call(name, request("storix:org.a/f/i"));
-  EXPECT_EQ(platform().trace().count("writeKeyedValueFileAtomically"), 0U);
+  EXPECT_THAT(
+      trace(),
+      ElementsAreArray(joined(
+          {start("storix:org.a/f/i"),
+           message("URLForItemID:completionHandler:", "org.a", "request-3", "_URLForItemIdentifier:completion:", "f/i",
+                   "()"),
+           {"log debug [DEBUG] Successfully retrieved URL (null) for item ID “f/i” from extension org.a",
+            "log info [INFO] Successfully extended sandbox of URL (null) from provider ID org.a to consumer ID "
+            "org.app.",
+            reply(name, "((null), (null), (null), (null), (null))", platformThread), cancel("org.a", "request-3")}})));
 }
 
 TEST_F(DocumentURLRequestTest, TheStoreIsTheSharedOneServerOrNot) {
@@ -167,14 +178,10 @@ TEST_F(DocumentURLRequestTest, AFailedBeginIsASandboxFailureAndTheRequestStaysOp
   process("org.a").setBeginFailure(error);
   call(name, request("storix:org.a/f/i"));
   EXPECT_THAT(trace(),
-              ElementsAreArray(joined(
-                  {start("storix:org.a/f/i"),
-                   {"log debug [DEBUG] -[SXExtensionStorix URLForItemID:completionHandler:]",
-                    "beginExtensionRequest org.a version 1 request-3", "begin failed request-3 " + text(error),
-                    "log debug [DEBUG] Beginning extension request.",
-                    "log fault [ERROR] Extension request failed. Error: " + text(error),
-                    "log fault [ERROR] Cannot get URL for item ID “f/i” for extension org.a. Error: " + text(error),
-                    failed(SXSandboxExtensionFailedError(std::nullopt), platformThread)}})));
+              ElementsAreArray(joined({start("storix:org.a/f/i"),
+                                       failedBegin("URLForItemID:completionHandler:", "org.a", "request-3",
+                                                   "Cannot get URL for item ID “f/i”", error),
+                                       {failed(SXSandboxExtensionFailedError(std::nullopt), platformThread)}})));
 }
 
 TEST_F(DocumentURLRequestTest, ALateConnectionFailureRepliesAgainWithAnError) {

@@ -97,6 +97,14 @@ class GrantedItemRequestTest : public ItemRequestsTest, public ::testing::WithPa
   std::vector<std::string> identified(const Arguments &given) {
     return joined({served(GetParam().name, given), {admitted}, lookup(), identification("org.a", "request-3", *item_)});
   }
+  /// The message itself. It is begun inside the completion of the first message, so before that one's
+  /// request ends.
+  [[nodiscard]] std::vector<std::string> forwarded(const std::string &answer) const {
+    std::vector<std::string> lines =
+        message(GetParam().operation, "org.a", "request-4", GetParam().message, itemText(), answer);
+    lines.insert(lines.begin() + 2, cancel("org.a", "request-3"));
+    return lines;
+  }
 };
 INSTANTIATE_TEST_SUITE_P(Requests, GrantedItemRequestTest, ::testing::Values(placeholder, start), labelOf);
 
@@ -104,17 +112,10 @@ TEST_P(GrantedItemRequestTest, AGrantedItemIsForwardedAndTheProvidersAnswerIsThe
   grant("org.a", "f/i", "org.app");
   const Arguments given = arguments(item_, "org.a", "org.app");
   call(GetParam().name, given);
-  std::vector<std::string> forwarded =
-      message(GetParam().operation, "org.a", "request-4", GetParam().message, itemText(), "()");
-  // Begun inside the completion of the first message, so before that one's request ends.
-  const std::vector<std::string> begun(forwarded.begin(), forwarded.begin() + 2);
-  const std::vector<std::string> rest(forwarded.begin() + 2, forwarded.end());
   EXPECT_THAT(
       trace(),
       ElementsAreArray(joined({identified(given),
-                               begun,
-                               {cancel("org.a", "request-3")},
-                               rest,
+                               forwarded("()"),
                                {"log debug " + GetParam().successLine + itemText() + " for extension org.a.",
                                 reply(GetParam().name, "((null))", platformThread), cancel("org.a", "request-4")}})));
 }
@@ -125,12 +126,15 @@ TEST_P(GrantedItemRequestTest, AFailureOfTheProviderIsTheReplyUnchanged) {
   Arguments answer{Argument(error)};
   if (!GetParam().looksUpByURL) answer = {Argument(), Argument(error)};
   process("org.a").setAnswer(GetParam().message, VendorAnswer::values(answer));
-  const std::shared_ptr<fake::FakeReply> answered = call(GetParam().name, arguments(item_, "org.a", "org.app"));
-  EXPECT_EQ(answered->error(0), SXPluginOperationFailedError(error));
-  EXPECT_EQ(answered->answer().context, platformThread);
-  // The provider object's line alone.
-  EXPECT_EQ(platform().trace().count("log fault"), 1U);
-  EXPECT_EQ(platform().trace().count("log fault " + GetParam().failureLine), 1U);
+  const Arguments given = arguments(item_, "org.a", "org.app");
+  call(GetParam().name, given);
+  EXPECT_THAT(trace(),
+              ElementsAreArray(joined(
+                  {identified(given),
+                   forwarded(fake::traced(answer)),
+                   {"log fault " + GetParam().failureLine + itemText() + " for extension org.a. Error: " + text(error),
+                    reply(GetParam().name, "(" + text(SXPluginOperationFailedError(error)) + ")", platformThread),
+                    cancel("org.a", "request-4")}})));
 }
 
 TEST_P(GrantedItemRequestTest, AConsumerWithoutGrantIsNotPermitted) {
@@ -149,18 +153,35 @@ TEST_P(GrantedItemRequestTest, AConsumerWithoutGrantIsNotPermitted) {
 TEST_P(GrantedItemRequestTest, AProviderThatCannotNameTheItemIsAnOperationThatFailed) {
   const SXError error = someError("no such item");
   process("org.a").setAnswer(identify, VendorAnswer::values({Argument(error), Argument("f/i")}));
-  const std::shared_ptr<fake::FakeReply> answered = call(GetParam().name, arguments(item_, "org.a", "org.app"));
-  EXPECT_EQ(answered->error(0), SXPluginOperationFailedError(SXPluginOperationFailedError(error)));
-  EXPECT_EQ(answered->answer().context, platformThread);
-  EXPECT_EQ(platform().trace().count("log fault"), 1U);
+  const Arguments given = arguments(item_, "org.a", "org.app");
+  call(GetParam().name, given);
+  const SXError wrapped = SXPluginOperationFailedError(SXPluginOperationFailedError(error));
+  EXPECT_THAT(
+      trace(),
+      ElementsAreArray(
+          joined({served(GetParam().name, given),
+                  {admitted},
+                  lookup(),
+                  failedIdentification("org.a", "request-3", *item_, "(" + text(error) + ", f/i)", error),
+                  {reply(GetParam().name, "(" + text(wrapped) + ")", platformThread), cancel("org.a", "request-3")}})));
 }
 
 TEST_P(GrantedItemRequestTest, AMissingItemIdentifierIsNotPermitted) {
   process("org.a").setAnswer(identify, VendorAnswer::values());
-  EXPECT_EQ(call(GetParam().name, arguments(item_, "org.a", "org.app"))->error(0), SXNotPermittedError());
-  EXPECT_TRUE(platform().log().contains(
-      LogSeverity::fault,
-      "[ERROR] Consumer ID org.app is not allowed to access item ID “(null)” from provider ID org.a."));
+  const Arguments given = arguments(item_, "org.a", "org.app");
+  call(GetParam().name, given);
+  EXPECT_THAT(
+      trace(),
+      ElementsAreArray(joined(
+          {served(GetParam().name, given),
+           {admitted},
+           lookup(),
+           message("itemIDForURL:completionHandler:", "org.a", "request-3",
+                   "_identifierForItemAtURL:completion:", itemText(), "()"),
+           {"log debug [DEBUG] Successfully got item ID “(null)” for URL " + itemText() + " from extension org.a",
+            "log fault [ERROR] Consumer ID org.app is not allowed to access item ID “(null)” from provider ID org.a.",
+            reply(GetParam().name, "(" + text(SXNotPermittedError()) + ")", platformThread),
+            cancel("org.a", "request-3")}})));
 }
 
 TEST_P(GrantedItemRequestTest, WithoutAServerNothingIsAllowed) {

@@ -14,7 +14,7 @@ class FileCoordinatorCallbacksTest : public ProvidersTest {
   void SetUp() override {
     startRegistry({"org.a", "org.b"});
     process("org.a").setAnswer("_identifierForItemAtURL:completion:",
-                               fake::VendorAnswer::values({Argument(), Argument("i")}));
+                               fake::VendorAnswer::values({Argument(), Argument("f/i")}));
     url_ = itemURL("org.a", "r");
   }
 

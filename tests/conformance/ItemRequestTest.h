@@ -29,10 +29,6 @@ class ItemRequestsTest : public ServicerTest {
 
   static constexpr const char *admitted = "entitlementValue peer 100 com.tessel.storix.acl-read";
 
-  [[nodiscard]] std::vector<std::string> ownerFound() const {
-    return {compared("org.a", *item_), "log info [INFO] Resolved URL to provider org.a."};
-  }
-
   void expectEarlyFailure(const ItemRequestCase &request, const Arguments &given,
                           const std::vector<std::string> &lookup, const SXError &error) {
     call(request.name, given);

@@ -5,36 +5,36 @@ namespace {
 
 using fake::VendorAnswer;
 using ::testing::Contains;
-using ::testing::ElementsAre;
+using ::testing::ElementsAreArray;
 
 constexpr const char *identify = "_identifierForItemAtURL:completion:";
 constexpr const char *start = "_startProvidingItemAtURL:completion:";
 
-using ProvideItemTest = FileCoordinatorCallbacksTest;
+class ProvideItemTest : public FileCoordinatorCallbacksTest {
+ protected:
+  [[nodiscard]] std::vector<std::string> requested(const std::string &reader) const {
+    return {"log info [INFO] KTFileCoordinator requested us to provide item at URL " + urlText() + " for consumer " +
+            reader};
+  }
+  /// The item's identifier is asked for, then the item; requests 1 and 2 were the registrations.
+  [[nodiscard]] std::vector<std::string> asked(const std::string &answer) const {
+    return joined(
+        {identification("org.a", "request-3", *url_),
+         {cancel("org.a", "request-3")},
+         message("startProvidingItemAtURL:completionHandler:", "org.a", "request-4", start, urlText(), answer)});
+  }
+  [[nodiscard]] std::vector<std::string> provided() const {
+    return joined({asked("()"),
+                   {"log debug [DEBUG] Successfully provided item at URL " + urlText() + " for extension org.a.",
+                    "answered ((null)) on platform thread", cancel("org.a", "request-4")}});
+  }
+};
 
 TEST_F(ProvideItemTest, AReadAsksForTheIdentifierAndThenProvides) {
   provider()->_provideItemAtURL(url_, "reader-1", recording<SXError>("answered"));
   runUntilIdle();
   // Requests 1 and 2 were the registrations.
-  EXPECT_THAT(
-      trace(),
-      ElementsAre(
-          "log info [INFO] KTFileCoordinator requested us to provide item at URL " + urlText() +
-              " for consumer reader-1",
-          "log debug [DEBUG] -[SXExtensionStorix itemIDForURL:completionHandler:]",
-          "beginExtensionRequest org.a version 1 request-3", "begun request-3",
-          "log debug [DEBUG] Beginning extension request.", "extensionContextForRequest org.a version 1 request-3",
-          "remoteProxyWithErrorHandler request-3", std::string("send request-3 ") + identify + " (" + urlText() + ")",
-          std::string("answer request-3 ") + identify + " ((null), i)",
-          "log debug [DEBUG] Successfully got item ID “i” for URL " + urlText() + " from extension org.a",
-          "cancelExtensionRequest org.a version 1 request-3",
-          "log debug [DEBUG] -[SXExtensionStorix startProvidingItemAtURL:completionHandler:]",
-          "beginExtensionRequest org.a version 1 request-4", "begun request-4",
-          "log debug [DEBUG] Beginning extension request.", "extensionContextForRequest org.a version 1 request-4",
-          "remoteProxyWithErrorHandler request-4", std::string("send request-4 ") + start + " (" + urlText() + ")",
-          std::string("answer request-4 ") + start + " ()",
-          "log debug [DEBUG] Successfully provided item at URL " + urlText() + " for extension org.a.",
-          "answered ((null)) on platform thread", "cancelExtensionRequest org.a version 1 request-4"));
+  EXPECT_THAT(trace(), ElementsAreArray(joined({requested("reader-1"), provided()})));
 }
 
 TEST_F(ProvideItemTest, ProvidingStartsOnTheGlobalQueue) {
@@ -58,14 +58,12 @@ TEST_F(ProvideItemTest, AnUnknownItemIsReportedAsReceived) {
   provider()->_provideItemAtURL(url_, "reader-1", recording<SXError>("answered"));
   runUntilIdle();
   const std::string error = text(SXPluginOperationFailedError(cause));
-  EXPECT_EQ(platform().trace().count(std::string("send request-4")), 0U);
-  const std::vector<std::string> lines = trace();
-  ASSERT_GE(lines.size(), 4U);
-  EXPECT_EQ(lines[lines.size() - 4], "log fault [ERROR] Proxy failed to get item ID for URL " + urlText() +
-                                         " for extension org.a. Error: " + text(cause));
-  EXPECT_EQ(lines[lines.size() - 3], "log fault [ERROR] Could not provide item at URL " + urlText() +
-                                         " from extension org.a to reader reader-1. Error: " + error);
-  EXPECT_EQ(lines[lines.size() - 2], "answered (" + error + ") on platform thread");
+  EXPECT_THAT(trace(), ElementsAreArray(joined(
+                           {requested("reader-1"),
+                            failedIdentification("org.a", "request-3", *url_, "(" + text(cause) + ", (null))", cause),
+                            {"log fault [ERROR] Could not provide item at URL " + urlText() +
+                                 " from extension org.a to reader reader-1. Error: " + error,
+                             "answered (" + error + ") on platform thread", cancel("org.a", "request-3")}})));
 }
 
 TEST_F(ProvideItemTest, AFailureToProvideIsTheOperationsError) {
@@ -73,10 +71,13 @@ TEST_F(ProvideItemTest, AFailureToProvideIsTheOperationsError) {
   process("org.a").setAnswer(start, VendorAnswer::values({Argument(cause)}));
   provider()->_provideItemAtURL(url_, "reader-1", recording<SXError>("answered"));
   runUntilIdle();
-  EXPECT_TRUE(platform().log().contains(LogSeverity::fault, "[ERROR] Proxy failed to start providing item at URL " +
-                                                                urlText() +
-                                                                " for extension org.a. Error: " + text(cause)));
-  EXPECT_EQ(platform().trace().count("answered (" + text(SXPluginOperationFailedError(cause)) + ")"), 1U);
+  EXPECT_THAT(trace(), ElementsAreArray(
+                           joined({requested("reader-1"),
+                                   asked("(" + text(cause) + ")"),
+                                   {"log fault [ERROR] Proxy failed to start providing item at URL " + urlText() +
+                                        " for extension org.a. Error: " + text(cause),
+                                    "answered (" + text(SXPluginOperationFailedError(cause)) + ") on platform thread",
+                                    cancel("org.a", "request-4")}})));
 }
 
 TEST_F(ProvideItemTest, AReadWithoutCompletionIsServedAllTheSame) {
@@ -92,12 +93,10 @@ TEST_F(ProvideItemTest, TheDeprecatedCallbackIsAReadWithoutReader) {
   provider()->_provideItemAtURL(url_, recording<SXError>("answered"));
   runUntilIdle();
   EXPECT_THAT(
-      platform().log().lines()[0],
-      (fake::LogLine{LogSeverity::fault, "[ERROR] Calling deprecated method: _provideItemAtURL:completionHandler:"}));
-  EXPECT_THAT(platform().log().lines()[1],
-              (fake::LogLine{LogSeverity::info, "[INFO] KTFileCoordinator requested us to provide item at URL " +
-                                                    urlText() + " for consumer (null)"}));
-  EXPECT_THAT(trace(), Contains("answered ((null)) on platform thread"));
+      trace(),
+      ElementsAreArray(joined({{"log fault [ERROR] Calling deprecated method: _provideItemAtURL:completionHandler:"},
+                               requested("(null)"),
+                               provided()})));
 }
 
 TEST_F(ProvideItemTest, TheServiceReachesTheProviderOnItsOwnQueueAndGetsItsAnswer) {
@@ -109,7 +108,7 @@ TEST_F(ProvideItemTest, TheServiceReachesTheProviderOnItsOwnQueueAndGetsItsAnswe
 TEST_F(ProvideItemTest, NoGrantIsAskedFor) {
   provider()->_provideItemAtURL(url_, "reader-nobody-knows", recording<SXError>("answered"));
   runUntilIdle();
-  EXPECT_EQ(platform().trace().count("answered ((null))"), 1U);
+  EXPECT_THAT(trace(), ElementsAreArray(joined({requested("reader-nobody-knows"), provided()})));
 }
 
 TEST_F(ProvideItemTest, AFailedBeginIsReportedAndTheRequestStaysOpen) {
@@ -117,8 +116,13 @@ TEST_F(ProvideItemTest, AFailedBeginIsReportedAndTheRequestStaysOpen) {
   process("org.a").setBeginFailure(error);
   provider()->_provideItemAtURL(url_, "reader-1", recording<SXError>("answered"));
   runUntilIdle();
-  EXPECT_EQ(platform().trace().count("answered (" + text(SXPluginOperationFailedError(error)) + ")"), 1U);
-  EXPECT_EQ(platform().trace().count("cancelExtensionRequest"), 0U);
+  const std::string wrapped = text(SXPluginOperationFailedError(error));
+  EXPECT_THAT(trace(), ElementsAreArray(joined({requested("reader-1"),
+                                                failedBegin("itemIDForURL:completionHandler:", "org.a", "request-3",
+                                                            "Cannot get item ID for URL " + urlText(), error),
+                                                {"log fault [ERROR] Could not provide item at URL " + urlText() +
+                                                     " from extension org.a to reader reader-1. Error: " + wrapped,
+                                                 "answered (" + wrapped + ") on platform thread"}})));
 }
 
 TEST_F(ProvideItemTest, ALateConnectionFailureAnswersAgain) {

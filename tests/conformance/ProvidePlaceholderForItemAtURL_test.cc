@@ -12,9 +12,16 @@ using ProvidePlaceholderTest = ItemRequestsTest;
 TEST_F(ProvidePlaceholderTest, APlaceholderIsAskedOfTheNamedProviderWhoeverOwnsTheURL) {
   const SXError error = someError("not mine");
   process("org.b").setAnswer(identify, VendorAnswer::values({Argument(error), Argument()}));
-  const std::shared_ptr<fake::FakeReply> answered = call(placeholder.name, arguments(item_, "org.b", "org.app"));
-  EXPECT_EQ(answered->error(0), SXPluginOperationFailedError(SXPluginOperationFailedError(error)));
-  EXPECT_EQ(platform().trace().count("directoryRelationship"), 0U);
+  const Arguments given = arguments(item_, "org.b", "org.app");
+  call(placeholder.name, given);
+  const SXError wrapped = SXPluginOperationFailedError(SXPluginOperationFailedError(error));
+  EXPECT_THAT(
+      trace(),
+      ::testing::ElementsAreArray(joined(
+          {served(placeholder.name, given),
+           {admitted},
+           failedIdentification("org.b", "request-3", *item_, "(" + text(error) + ", (null))", error),
+           {reply(placeholder.name, "(" + text(wrapped) + ")", platformThread), cancel("org.b", "request-3")}})));
 }
 
 }  // namespace

@@ -3,6 +3,8 @@
 namespace storix {
 namespace {
 
+using ::testing::ElementsAreArray;
+
 using StartProvidingTest = ItemRequestsTest;
 
 TEST_F(StartProvidingTest, StartNamesTheIdentifierThatDoesNotFitTheOwner) {
@@ -23,10 +25,15 @@ TEST_F(StartProvidingTest, AProvidersDirectoryItselfHasNoOwner) {
 TEST_F(StartProvidingTest, AFailedBeginIsReportedTwiceWrappedAndTheRequestStaysOpen) {
   const SXError error = someError("no process");
   process("org.a").setBeginFailure(error);
-  const std::shared_ptr<fake::FakeReply> answered = call(start.name, arguments(item_, "org.a", "org.app"));
-  EXPECT_EQ(answered->error(0), SXPluginOperationFailedError(SXPluginOperationFailedError(error)));
-  EXPECT_EQ(platform().trace().count("cancelExtensionRequest"), 0U);
-  EXPECT_EQ(platform().trace().count("log fault [ERROR] Cannot get item ID for URL " + itemText()), 1U);
+  const Arguments given = arguments(item_, "org.a", "org.app");
+  call(start.name, given);
+  const SXError wrapped = SXPluginOperationFailedError(SXPluginOperationFailedError(error));
+  EXPECT_THAT(trace(), ElementsAreArray(joined({served(start.name, given),
+                                                {admitted},
+                                                ownerFound(),
+                                                failedBegin("itemIDForURL:completionHandler:", "org.a", "request-3",
+                                                            "Cannot get item ID for URL " + itemText(), error),
+                                                {reply(start.name, "(" + text(wrapped) + ")", platformThread)}})));
 }
 
 TEST_F(StartProvidingTest, ASecondBeginThatFailsIsReportedOnceWrappedAndThatRequestStaysOpen) {
@@ -36,13 +43,19 @@ TEST_F(StartProvidingTest, ASecondBeginThatFailsIsReportedOnceWrappedAndThatRequ
     process("org.a").setBeginFailure(error);
     return fake::VendorAnswer::values({Argument(), Argument("f/i")});
   });
-  const std::shared_ptr<fake::FakeReply> answered = call(start.name, arguments(item_, "org.a", "org.app"));
-  EXPECT_EQ(answered->error(0), SXPluginOperationFailedError(error));
-  EXPECT_EQ(platform().trace().count(cancel("org.a", "request-3")), 1U);
-  EXPECT_EQ(platform().trace().count("cancelExtensionRequest"), 1U);
-  EXPECT_EQ(platform().trace().count("log fault [ERROR] Cannot provide item at URL " + itemText() +
-                                     " for extension org.a. Error: " + text(error)),
-            1U);
+  const Arguments given = arguments(item_, "org.a", "org.app");
+  call(start.name, given);
+  std::vector<std::string> second =
+      failedBegin(start.operation, "org.a", "request-4", "Cannot provide item at URL " + itemText(), error);
+  second.insert(second.begin() + 2, cancel("org.a", "request-3"));
+  EXPECT_THAT(trace(),
+              ElementsAreArray(joined(
+                  {served(start.name, given),
+                   {admitted},
+                   ownerFound(),
+                   identification("org.a", "request-3", *item_),
+                   second,
+                   {reply(start.name, "(" + text(SXPluginOperationFailedError(error)) + ")", platformThread)}})));
 }
 
 }  // namespace

@@ -4,68 +4,72 @@ namespace storix {
 namespace {
 
 using ::testing::ElementsAre;
+using ::testing::ElementsAreArray;
 
-using FinishedWriteTest = FileCoordinatorCallbacksTest;
+class FinishedWriteTest : public FileCoordinatorCallbacksTest {
+ protected:
+  /// The owner of the URL is found.
+  [[nodiscard]] static std::vector<std::string> routed(const URL &url, const std::string &owner) {
+    const std::string written = url.absoluteString();
+    std::vector<std::string> lines{"log info [INFO] KTFileCoordinator is telling us the item at URL " + written +
+                                   " was changed by writer ID writer-1."};
+    for (const char *provider : {"org.a", "org.b"}) {
+      lines.push_back("directoryRelationship " + storageText(provider) + " " + written);
+      if (provider == owner) break;
+    }
+    lines.push_back("log info [INFO] Resolved URL to provider " + owner + ".");
+    lines.push_back("log debug [DEBUG] The item at URL " + written + " is provided by the etxension " + owner);
+    return lines;
+  }
+  /// The owner is found and told.
+  [[nodiscard]] static std::vector<std::string> told(const URL &url, const std::string &owner,
+                                                     const std::string &answer = "()") {
+    return joined({routed(url, owner), message("itemChangedAtURL:", owner, "request-3",
+                                               "_itemChangedAtURL:completion:", url.absoluteString(), answer)});
+  }
+};
 
 TEST_F(FinishedWriteTest, AFinishedWriteIsToldToTheOwnerOfTheURL) {
   provider()->_writerWithID("writer-1", url_);
   runUntilIdle();
-  EXPECT_THAT(
-      trace(),
-      ElementsAre(
-          "log info [INFO] KTFileCoordinator is telling us the item at URL " + urlText() +
-              " was changed by writer ID writer-1.",
-          "directoryRelationship " + storageText("org.a") + " " + urlText(),
-          "log info [INFO] Resolved URL to provider org.a.",
-          "log debug [DEBUG] The item at URL " + urlText() + " is provided by the etxension org.a",
-          "log debug [DEBUG] -[SXExtensionStorix itemChangedAtURL:]", "beginExtensionRequest org.a version 1 request-3",
-          "begun request-3", "log debug [DEBUG] Beginning extension request.",
-          "extensionContextForRequest org.a version 1 request-3", "remoteProxyWithErrorHandler request-3",
-          "send request-3 _itemChangedAtURL:completion: (" + urlText() + ")",
-          "answer request-3 _itemChangedAtURL:completion: ()", "cancelExtensionRequest org.a version 1 request-3"));
+  EXPECT_THAT(trace(), ElementsAreArray(joined({told(*url_, "org.a"), {cancel("org.a", "request-3")}})));
 }
 
 TEST_F(FinishedWriteTest, AWriteUnderAnotherProviderGoesToThatOne) {
   const URL other = itemURL("org.b", "r");
   provider()->_writerWithID("writer-1", other);
   runUntilIdle();
-  EXPECT_TRUE(platform().log().contains(
-      LogSeverity::debug, "[DEBUG] The item at URL " + other.absoluteString() + " is provided by the etxension org.b"));
-  EXPECT_EQ(platform().trace().count("beginExtensionRequest org.b"), 1U);
-  EXPECT_EQ(platform().trace().count("beginExtensionRequest org.a"), 0U);
+  EXPECT_THAT(trace(), ElementsAreArray(joined({told(other, "org.b"), {cancel("org.b", "request-3")}})));
 }
 
 TEST_F(FinishedWriteTest, AWriteOutsideEveryProviderIsAnError) {
   provider()->_writerWithID(std::nullopt, *URL::fromString("file:///elsewhere"));
   runUntilIdle();
-  EXPECT_THAT(platform().log().take(),
-              ElementsAre(fake::LogLine{LogSeverity::info,
-                                        "[INFO] KTFileCoordinator is telling us the item at URL "
-                                        "file:///elsewhere was changed by writer ID (null)."},
-                          fake::LogLine{LogSeverity::fault,
-                                        "[ERROR] Could not find any extension that provides an "
-                                        "item at URL file:///elsewhere"}));
-  EXPECT_EQ(platform().trace().count("beginExtensionRequest"), 0U);
+  EXPECT_THAT(trace(), ElementsAre("log info [INFO] KTFileCoordinator is telling us the item at URL file:///elsewhere "
+                                   "was changed by writer ID (null).",
+                                   "directoryRelationship " + storageText("org.a") + " file:///elsewhere",
+                                   "directoryRelationship " + storageText("org.b") + " file:///elsewhere",
+                                   "log fault [ERROR] Could not find any extension that provides an item at URL "
+                                   "file:///elsewhere"));
 }
 
 TEST_F(FinishedWriteTest, AWriteOfAProvidersDirectoryItselfIsPassedOver) {
   provider()->_writerWithID("writer-1", storageURL("org.a"));
   runUntilIdle();
-  EXPECT_THAT(logTexts(), ElementsAre("[INFO] KTFileCoordinator is telling us the item at URL " + storageText("org.a") +
-                                          " was changed by writer ID writer-1.",
-                                      "[DEBUG] Ignoring URLs that exactly match the document container folder"));
-  EXPECT_EQ(platform().trace().count("beginExtensionRequest"), 0U);
+  EXPECT_THAT(trace(), ElementsAre("log info [INFO] KTFileCoordinator is telling us the item at URL " +
+                                       storageText("org.a") + " was changed by writer ID writer-1.",
+                                   "directoryRelationship " + storageText("org.a") + " " + storageText("org.a"),
+                                   "log debug [DEBUG] Ignoring URLs that exactly match the document container folder"));
 }
 
 TEST_F(FinishedWriteTest, AFailedBeginIsLoggedWithoutItsErrorAndTheRequestIsEnded) {
-  process("org.a").setBeginFailure(someError("no process"));
+  const SXError error = someError("no process");
+  process("org.a").setBeginFailure(error);
   provider()->_writerWithID("writer-1", url_);
   runUntilIdle();
-  const std::vector<std::string> lines = trace();
-  ASSERT_GE(lines.size(), 2U);
-  EXPECT_EQ(lines[lines.size() - 2],
-            "log fault [ERROR] Cannot tell extension org.a that item at URL " + urlText() + " has changed.");
-  EXPECT_EQ(lines.back(), "cancelExtensionRequest org.a version 1 request-3");
+  std::vector<std::string> begun = failedBegin("itemChangedAtURL:", "org.a", "request-3", "", error);
+  begun.back() = "log fault [ERROR] Cannot tell extension org.a that item at URL " + urlText() + " has changed.";
+  EXPECT_THAT(trace(), ElementsAreArray(joined({routed(*url_, "org.a"), begun, {cancel("org.a", "request-3")}})));
 }
 
 TEST_F(FinishedWriteTest, TheExtensionsErrorIsLoggedAndTheRequestIsEnded) {
@@ -73,11 +77,10 @@ TEST_F(FinishedWriteTest, TheExtensionsErrorIsLoggedAndTheRequestIsEnded) {
   process("org.a").setAnswer("_itemChangedAtURL:completion:", fake::VendorAnswer::values({Argument(error)}));
   provider()->_writerWithID("writer-1", url_);
   runUntilIdle();
-  const std::vector<std::string> lines = trace();
-  ASSERT_GE(lines.size(), 2U);
-  EXPECT_EQ(lines[lines.size() - 2], "log fault [ERROR] Could not tell extension org.a that item at URL " + urlText() +
-                                         " has changed. Error: " + text(error));
-  EXPECT_EQ(lines.back(), "cancelExtensionRequest org.a version 1 request-3");
+  EXPECT_THAT(trace(), ElementsAreArray(joined({told(*url_, "org.a", "(" + text(error) + ")"),
+                                                {"log fault [ERROR] Could not tell extension org.a that item at URL " +
+                                                     urlText() + " has changed. Error: " + text(error),
+                                                 cancel("org.a", "request-3")}})));
 }
 
 }  // namespace
