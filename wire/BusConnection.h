@@ -36,7 +36,7 @@ struct BusMethod;
 ///     EPOLLOUT, and the wanted-changed handler says so to the driver.
 ///  3. A request gets at most one reply. One that comes after the end is dropped, and a request whose
 ///     reply handler is destroyed unused stays unanswered.
-///  4. With 256 requests in flight nothing is read until one of them has ended.
+///  4. With as many requests in flight as the options permit nothing is read until one of them has ended.
 ///  5. Of each message that is sent away, exactly one handler hears, once: inside `process`, or through
 ///     `runLater`; never inside the call that took it.
 ///  6. The closed handler runs once, after the handlers of all messages in flight.
@@ -51,6 +51,8 @@ class BusConnection : public std::enable_shared_from_this<BusConnection> {
     Descriptors descriptors = Descriptors::refused;
     /// Who the peer is, for log lines: "pid 4711".
     std::string peer;
+    /// Requests of the peer that may be in flight before nothing more is read.
+    std::size_t requestsInFlightAtMost = 256;
     /// Runs a task soon, not inside this call: `ThreadPool::execute`, or the driving thread's own list.
     std::function<void(Task)> runLater;
   };

@@ -20,9 +20,7 @@
 
 namespace storix::wire {
 
-/// Requests of the peer that may be in flight before nothing more is read.
-inline constexpr std::size_t maximumRequestsInFlight = 256;
-/// Further ones that sd-bus may read beside the writing that was asked of it.
+/// Requests that sd-bus may read beyond those in flight, beside the writing that was asked of it.
 inline constexpr std::size_t maximumHeldRequests = 16;
 
 inline std::string_view textOrEmpty(const char *text) { return text ? std::string_view(text) : std::string_view(); }
@@ -103,7 +101,7 @@ struct BusConnection::State {
   std::size_t requestsInFlight = 0;
   std::deque<OwnedMessage> held;
 
-  [[nodiscard]] bool isFull() const { return requestsInFlight >= maximumRequestsInFlight; }
+  [[nodiscard]] bool isFull() const { return requestsInFlight >= options.requestsInFlightAtMost; }
 
   [[nodiscard]] bool hasUnwritten() const {
     std::uint64_t count = 0;

@@ -82,13 +82,16 @@ std::optional<URL> ProviderExtension::providedItemsURL() const {
 std::optional<std::string> ProviderExtension::relativePath(const URL &url) const {
   const auto directory = providedItemsURL();
   if (!directory) return std::nullopt;
-  if (auto path = below(directory->path(), url.path())) return path;
+  auto asItStands = below(directory->path(), url.path());
   std::error_code failed;
   const auto resolvedDirectory = std::filesystem::canonical(directory->path(), failed);
+  // A directory that is not there yet holds no link.
+  if (failed == std::errc::no_such_file_or_directory) return asItStands;
   if (failed) return std::nullopt;
   const auto resolved = std::filesystem::weakly_canonical(url.path(), failed);
   if (failed) return std::nullopt;
-  return below(resolvedDirectory.string(), resolved.string());
+  auto resolvedPath = below(resolvedDirectory.string(), resolved.string());
+  return resolvedPath && asItStands ? asItStands : resolvedPath;
 }
 
 }  // namespace storix

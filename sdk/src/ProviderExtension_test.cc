@@ -5,10 +5,14 @@
 #include <gtest/gtest.h>
 #include <sys/socket.h>
 
+#include <atomic>
+#include <condition_variable>
 #include <cstdlib>
 #include <filesystem>
 #include <future>
+#include <mutex>
 #include <stdexcept>
+#include <stop_token>
 #include <thread>
 
 #include "providers/_KTStorixVendor.h"
@@ -23,6 +27,7 @@ using ::testing::HasSubstr;
 /// Does as the test says.
 class ScriptedExtension : public ProviderExtension {
  public:
+  using ProviderExtension::cancellation;
   using ProviderExtension::providedItemsURL;
   using ProviderExtension::ProviderExtension;
   using ProviderExtension::relativePath;
@@ -31,7 +36,27 @@ class ScriptedExtension : public ProviderExtension {
     completion(std::nullopt);
   };
   void startProviding(const URL &url, Completion completion) override { onStart(url, std::move(completion)); }
+
+  std::atomic<int> changes = 0;
+  void itemChanged(const URL & /*url*/, Completion completion) override {
+    ++changes;
+    completion(std::nullopt);
+  }
+
+  std::optional<std::string> identifier;
+  void itemIdentifier(const URL &url, IdentifierCompletion completion) override {
+    if (identifier) return completion(*identifier);
+    ProviderExtension::itemIdentifier(url, std::move(completion));
+  }
 };
+
+/// Waits until the daemon has gone.
+void waitForCancellation(const std::stop_token &cancellation) {
+  std::mutex mutex;
+  std::condition_variable_any never;
+  std::unique_lock lock(mutex);
+  never.wait(lock, cancellation, [] { return false; });
+}
 
 class ProviderExtensionTest : public ::testing::Test {
  protected:
@@ -107,6 +132,18 @@ TEST_F(ProviderExtensionTest, RelativePathsStayInside) {
   EXPECT_EQ(extension_->relativePath(*URL::fileURLWithPath(directory_ + "/group/Storix Storage 2/a")), std::nullopt);
 }
 
+TEST_F(ProviderExtensionTest, RelativePathsFollowNoLinkOut) {
+  const std::string storage = directory_ + "/group/Storix Storage";
+  fs::create_directories(storage + "/inside");
+  fs::create_symlink(directory_, storage + "/out");
+  fs::create_symlink("inside", storage + "/in");
+  fs::create_symlink("loop", storage + "/loop");
+  EXPECT_EQ(extension_->relativePath(item("out/secret")), std::nullopt);
+  EXPECT_EQ(extension_->relativePath(item("out")), std::nullopt);
+  EXPECT_EQ(extension_->relativePath(item("in/a")), "in/a") << "an item keeps the name by which it is asked for";
+  EXPECT_EQ(extension_->relativePath(item("loop/a")), std::nullopt);
+}
+
 // --- Serving the daemon
 
 /// The daemon's end of an extension's connection, and the extension served on a thread.
@@ -141,6 +178,14 @@ class ServedExtensionTest : public ProviderExtensionTest {
     loop_.stop();
     loopThread_.join();
     ProviderExtensionTest::TearDown();
+  }
+
+  std::pair<std::optional<SXError>, std::optional<std::string>> identifier(const URL &url) {
+    std::promise<std::pair<std::optional<SXError>, std::optional<std::string>>> answer;
+    vendor_->_identifierForItemAtURL(url, [&](std::optional<SXError> error, std::optional<std::string> identifier) {
+      answer.set_value({std::move(error), std::move(identifier)});
+    });
+    return answer.get_future().get();
   }
 
   std::optional<SXError> start(const URL &url) {
@@ -185,10 +230,7 @@ TEST_F(ServedExtensionTest, EveryOperationReachesTheExtension) {
                                    [&](std::optional<SXError> error) { stopped.set_value(std::move(error)); });
   EXPECT_EQ(stopped.get_future().get(), std::nullopt);
 
-  std::promise<std::optional<std::string>> identifier;
-  vendor_->_identifierForItemAtURL(
-      item("a b"), [&](const auto &, std::optional<std::string> given) { identifier.set_value(std::move(given)); });
-  EXPECT_EQ(identifier.get_future().get(), "a b");
+  EXPECT_EQ(identifier(item("a b")).second, "a b");
 
   std::promise<std::optional<URL>> url;
   vendor_->_URLForItemIdentifier("a b",
@@ -253,6 +295,22 @@ TEST_F(ServedExtensionTest, ASlowDocumentDoesNotHoldUpTheOthers) {
   EXPECT_EQ(slow.get_future().get(), std::nullopt);
 }
 
+TEST_F(ServedExtensionTest, AnEmptyIdentifierBecomesAnError) {
+  extension_->identifier = "";
+  const auto [error, given] = identifier(item("a"));
+  ASSERT_TRUE(error.has_value());
+  EXPECT_THAT(error->message(), HasSubstr("the provider gave an empty identifier"));
+  EXPECT_EQ(given, std::nullopt);
+}
+
+TEST_F(ServedExtensionTest, AnyNumberOfSlowDocumentsHoldsUpNoIdentifier) {
+  extension_->onStart = [this](const URL &, const ProviderExtension::Completion &) {
+    waitForCancellation(extension_->cancellation());
+  };
+  for (int i = 0; i < 300; ++i) vendor_->_startProvidingItemAtURL(item(std::to_string(i)), {});
+  EXPECT_EQ(identifier(item("a")).second, "a");
+}
+
 TEST_F(ServedExtensionTest, ACompletionMayBeCalledLaterFromAnyThread) {
   std::promise<ProviderExtension::Completion> taken;
   extension_->onStart = [&taken](const URL &, ProviderExtension::Completion completion) {
@@ -280,6 +338,52 @@ TEST_F(ServedExtensionTest, TheEndOfTheConnectionWaitsForCallsUnderWay) {
   release.set_value();
   EXPECT_EQ(served_.get(), 0);
   EXPECT_TRUE(finished);
+}
+
+TEST_F(ServedExtensionTest, CallsUnderWayLearnThatTheDaemonHasGone) {
+  std::promise<void> holding;
+  extension_->onStart = [&](const URL &, const ProviderExtension::Completion &) {
+    EXPECT_FALSE(extension_->cancellation().stop_requested());
+    holding.set_value();
+    waitForCancellation(extension_->cancellation());
+  };
+  vendor_->_startProvidingItemAtURL(item("a"), {});
+  holding.get_future().wait();
+  connection_->close();
+  EXPECT_EQ(served_.get(), 0);
+  EXPECT_TRUE(extension_->cancellation().stop_requested());
+}
+
+TEST_F(ServedExtensionTest, WorkThatAnswersLaterIsToldWhenTheDaemonHasGone) {
+  std::promise<void> told;
+  std::optional<std::stop_callback<std::function<void()>>> registered;
+  ProviderExtension::Completion kept;
+  extension_->onStart = [&](const URL &, const ProviderExtension::Completion &completion) {
+    kept = completion;
+    registered.emplace(extension_->cancellation(), [&told] { told.set_value(); });
+  };
+  vendor_->_startProvidingItemAtURL(item("a"), {});
+  identifier(item("a"));
+  connection_->close();
+  EXPECT_EQ(served_.get(), 0);
+  EXPECT_EQ(told.get_future().wait_for(std::chrono::seconds(60)), std::future_status::ready);
+  kept(std::nullopt);
+}
+
+TEST_F(ServedExtensionTest, OfTheCallsThatHaveNotBegunOnlyChangesAreCarriedOutWithoutTheDaemon) {
+  std::atomic<int> begun = 0;
+  extension_->onStart = [&](const URL &, const ProviderExtension::Completion &) {
+    ++begun;
+    waitForCancellation(extension_->cancellation());
+  };
+  for (int i = 0; i < 20; ++i) vendor_->_startProvidingItemAtURL(item(std::to_string(i)), {});
+  vendor_->_itemChangedAtURL(item("a"), {});
+  identifier(item("a"));  // All that was sent before it has been read.
+  EXPECT_EQ(extension_->changes, 0);
+  connection_->close();
+  EXPECT_EQ(served_.get(), 0);
+  EXPECT_LE(begun, 8);
+  EXPECT_EQ(extension_->changes, 1);
 }
 
 TEST(ServeProviderExtension, APeerThatEndsBeforeTheLoginIsAFailure) {

@@ -8,6 +8,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <exception>
+#include <stop_token>
 #include <string_view>
 #include <utility>
 
@@ -20,8 +21,21 @@ namespace storix {
 
 namespace {
 
-/// Calls of the extension that may be at work at the same time.
+/// Calls of the extension that may be at work at the same time, of each of the two kinds.
 constexpr std::size_t concurrentCalls = 8;
+
+/// The daemon itself bounds what it asks. Calls that wait for a thread must not keep others, which have
+/// one, from being read.
+constexpr std::size_t unansweredCallsAtMost = std::size_t{1} << 20;
+
+/// Threads for calls that move content and may take long, and for those that are answered at once.
+struct CallThreads {
+  ThreadPool transfers{concurrentCalls};
+  ThreadPool lookups{concurrentCalls};
+};
+
+/// What becomes of calls that have not begun when the daemon goes away.
+enum class WithoutDaemon { dropped, carriedOut };
 
 /// A completion handler whose first call sends the answer. When nobody can call it any more, the
 /// answer is an error.
@@ -52,20 +66,27 @@ CompletionHandler<Replies...> orNobody(CompletionHandler<Replies...> completion)
 
 SXError nothingGiven(std::string_view what) { return posixError(EINVAL, "looking for the " + std::string(what)); }
 
+SXError emptyIdentifier() {
+  return posixError(EINVAL, "identifying the document: the provider gave an empty identifier");
+}
+
 /// What the daemon calls: hands every operation to the extension, on a thread of the pool.
 class ExportedExtension : public _KTStorixVendor {
  public:
   using Outcome = std::optional<SXError>;
 
-  ExportedExtension(std::shared_ptr<ProviderExtension> extension, ThreadPool &pool)
-      : extension_(std::move(extension)), pool_(pool) {}
+  ExportedExtension(std::shared_ptr<ProviderExtension> extension, std::stop_token cancellation, CallThreads &threads)
+      : extension_(std::move(extension)), cancellation_(std::move(cancellation)), threads_(threads) {}
 
   void _performInitialSetupWithCompletion(CompletionHandler<std::string, URL, SXError> completion) override {
-    work<Outcome>([completion = orNobody(std::move(completion))](
-                      Outcome error) { completion(std::nullopt, std::nullopt, std::move(error)); },
-                  [](ProviderExtension &extension, ProviderExtension::Completion answer) {
-                    extension.performInitialSetup(std::move(answer));
-                  });
+    work<Outcome>(
+        threads_.lookups,
+        [completion = orNobody(std::move(completion))](Outcome error) {
+          completion(std::nullopt, std::nullopt, std::move(error));
+        },
+        [](ProviderExtension &extension, ProviderExtension::Completion answer) {
+          extension.performInitialSetup(std::move(answer));
+        });
   }
 
   void _providePlaceholderAtURL(std::optional<URL> url, CompletionHandler<URL, SXError> completion) override {
@@ -75,7 +96,8 @@ class ExportedExtension : public _KTStorixVendor {
     };
     if (!url) return answer(nothingGiven("URL of the document"));
     work<Result<URL>>(
-        answer, [url = *std::move(url)](ProviderExtension &extension, ProviderExtension::URLCompletion placeholder) {
+        threads_.lookups, answer,
+        [url = *std::move(url)](ProviderExtension &extension, ProviderExtension::URLCompletion placeholder) {
           extension.providePlaceholder(url, std::move(placeholder));
         });
   }
@@ -84,7 +106,7 @@ class ExportedExtension : public _KTStorixVendor {
     workOnItem(std::move(url), std::move(completion), &ProviderExtension::startProviding);
   }
   void _itemChangedAtURL(std::optional<URL> url, CompletionHandler<SXError> completion) override {
-    workOnItem(std::move(url), std::move(completion), &ProviderExtension::itemChanged);
+    workOnItem(std::move(url), std::move(completion), &ProviderExtension::itemChanged, WithoutDaemon::carriedOut);
   }
   void _stopProvidingItemAtURL(std::optional<URL> url, CompletionHandler<SXError> completion) override {
     workOnItem(std::move(url), std::move(completion), &ProviderExtension::stopProviding);
@@ -92,14 +114,17 @@ class ExportedExtension : public _KTStorixVendor {
 
   void _identifierForItemAtURL(std::optional<URL> url, CompletionHandler<SXError, std::string> completion) override {
     auto answer = [completion = orNobody(std::move(completion))](Result<std::string> identifier) {
-      if (identifier) return completion(std::nullopt, std::move(identifier.value()));
-      completion(identifier.error(), std::nullopt);
+      if (!identifier) return completion(identifier.error(), std::nullopt);
+      // A grant for it would be one for nothing, and the daemon takes an identifier as it is.
+      if (identifier.value().empty()) return completion(emptyIdentifier(), std::nullopt);
+      completion(std::nullopt, std::move(identifier.value()));
     };
     if (!url) return answer(nothingGiven("URL of the document"));
-    work<Result<std::string>>(answer, [url = *std::move(url)](ProviderExtension &extension,
-                                                              ProviderExtension::IdentifierCompletion identifier) {
-      extension.itemIdentifier(url, std::move(identifier));
-    });
+    work<Result<std::string>>(
+        threads_.lookups, answer,
+        [url = *std::move(url)](ProviderExtension &extension, ProviderExtension::IdentifierCompletion identifier) {
+          extension.itemIdentifier(url, std::move(identifier));
+        });
   }
 
   void _URLForItemIdentifier(std::optional<std::string> itemIdentifier,
@@ -109,18 +134,22 @@ class ExportedExtension : public _KTStorixVendor {
       completion(url.error(), std::nullopt);
     };
     if (!itemIdentifier) return answer(nothingGiven("identifier of the document"));
-    work<Result<URL>>(answer, [identifier = *std::move(itemIdentifier)](ProviderExtension &extension,
-                                                                        ProviderExtension::URLCompletion url) {
-      extension.itemURL(identifier, std::move(url));
-    });
+    work<Result<URL>>(
+        threads_.lookups, answer,
+        [identifier = *std::move(itemIdentifier)](ProviderExtension &extension, ProviderExtension::URLCompletion url) {
+          extension.itemURL(identifier, std::move(url));
+        });
   }
 
  private:
   template <class Answer>
-  void work(std::function<void(Answer)> send,
-            std::function<void(ProviderExtension &, std::function<void(Answer)>)> operation) {
+  void work(ThreadPool &threads, std::function<void(Answer)> send,
+            std::function<void(ProviderExtension &, std::function<void(Answer)>)> operation,
+            WithoutDaemon withoutDaemon = WithoutDaemon::dropped) {
     auto answer = answeringOnce<Answer>(std::move(send));
-    pool_.execute([extension = extension_, answer = std::move(answer), operation = std::move(operation)] {
+    threads.execute([extension = extension_, cancellation = cancellation_, withoutDaemon, answer = std::move(answer),
+                     operation = std::move(operation)] {
+      if (cancellation.stop_requested() && withoutDaemon == WithoutDaemon::dropped) return;
       try {
         operation(*extension, answer);
       } catch (const std::exception &thrown) {
@@ -132,17 +161,21 @@ class ExportedExtension : public _KTStorixVendor {
   }
 
   void workOnItem(std::optional<URL> url, CompletionHandler<SXError> completion,
-                  void (ProviderExtension::*function)(const URL &, ProviderExtension::Completion)) {
+                  void (ProviderExtension::*function)(const URL &, ProviderExtension::Completion),
+                  WithoutDaemon withoutDaemon = WithoutDaemon::dropped) {
     completion = orNobody(std::move(completion));
     if (!url) return completion(nothingGiven("URL of the document"));
-    work<Outcome>(std::move(completion), [url = *std::move(url), function](ProviderExtension &extension,
-                                                                           ProviderExtension::Completion answer) {
-      (extension.*function)(url, std::move(answer));
-    });
+    work<Outcome>(
+        threads_.transfers, std::move(completion),
+        [url = *std::move(url), function](ProviderExtension &extension, ProviderExtension::Completion answer) {
+          (extension.*function)(url, std::move(answer));
+        },
+        withoutDaemon);
   }
 
   std::shared_ptr<ProviderExtension> extension_;
-  ThreadPool &pool_;
+  const std::stop_token cancellation_;
+  CallThreads &threads_;
 };
 
 int complain(const std::string &sentence) {
@@ -154,13 +187,14 @@ int complain(const std::string &sentence) {
 
 int serveProviderExtension(std::shared_ptr<ProviderExtension> extension, int socket) {
   sdk::BusLoop loop;
-  ThreadPool pool(concurrentCalls);
+  CallThreads threads;
   std::optional<SXError> reason;
   bool ready = false;
   auto exported = std::make_shared<ProtocolExporter<_KTStorixVendor>>(
-      _KTStorixVendorProtocol(), std::make_shared<ExportedExtension>(std::move(extension), pool));
+      _KTStorixVendorProtocol(), std::make_shared<ExportedExtension>(extension, extension->cancellation(), threads));
   wire::BusConnection::Options options;
   options.peer = "the daemon";
+  options.requestsInFlightAtMost = unansweredCallsAtMost;
   const auto added = loop.add(UniqueFd(socket), std::move(options), [&](wire::BusConnection &connection) {
     connection.exportObject(LinkInterface(_KTStorixVendorProtocol().description()), std::move(exported));
     connection.setReadyHandler([&ready] { ready = true; });
@@ -171,6 +205,7 @@ int serveProviderExtension(std::shared_ptr<ProviderExtension> extension, int soc
   });
   if (!added) return complain("The connection to the document broker failed: " + added.error().message());
   loop.run();
+  extension->cancellation_.request_stop();
   if (!ready) {
     return complain("The document broker ended the connection before the login was done" +
                     (reason ? ": " + reason->message() : "."));
