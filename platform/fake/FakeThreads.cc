@@ -43,6 +43,7 @@ Task FakeExecutor::counted(Task task) {
 }
 
 void FakeExecutor::execute(Task task) {
+  if (submissionObserver_) submissionObserver_();
   if (manual_) {
     manual_->execute(std::move(task));
   } else {

@@ -3,6 +3,7 @@
 #include <condition_variable>
 #include <cstddef>
 #include <deque>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -47,6 +48,9 @@ class FakeExecutor : public Executor {
   /// Moves the clock of an executor that is run by hand.
   void advance(std::chrono::nanoseconds time);
 
+  /// Tells of every task that is submitted, for tests that care when. Set before anything runs.
+  void setSubmissionObserver(std::function<void()> observer) { submissionObserver_ = std::move(observer); }
+
   /// Runs the task as a callback of the platform's own, outside every queue.
   void runOnPlatformThread(Task task);
   /// As above, marked as the main event loop.
@@ -58,6 +62,7 @@ class FakeExecutor : public Executor {
   mutable std::mutex mutex_;
   std::condition_variable idle_;
   std::size_t outstanding_ = 0;
+  std::function<void()> submissionObserver_;
   // Last, so that the threads end before what they use.
   std::unique_ptr<ManualExecutor> manual_;
   std::unique_ptr<ThreadPool> threads_;

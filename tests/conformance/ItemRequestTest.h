@@ -1,5 +1,6 @@
 #pragma once
 
+#include <ostream>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -18,6 +19,8 @@ struct ItemRequestCase {
   std::string failureLine;   // of the provider object, up to the URL
   std::string earlyFailure;  // up to the URL
   bool looksUpByURL;
+
+  friend void PrintTo(const ItemRequestCase &request, std::ostream *out) { *out << request.label; }
 };
 
 class ItemRequestsTest : public ServicerTest {
