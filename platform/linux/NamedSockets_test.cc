@@ -18,13 +18,13 @@
 #include "platform/linux/TestDirectory.h"
 #include "platform/linux/TestLog.h"
 #include "platform/linux/TestPeers.h"
-#include "platform/linux/TestUser.h"
 #include "service/SXDaemon.h"
 #include "wire/TestConnection.h"
 
 namespace storix::linuxhost {
 namespace {
 
+using testing::AllOf;
 using testing::ElementsAre;
 using testing::HasSubstr;
 using testing::IsEmpty;
@@ -238,25 +238,20 @@ TEST_F(SocketTest, ConnectionsWaitWhileNoDescriptorIsLeftWithOneLogLine) {
 }
 
 TEST_F(SocketTest, ForeignUserIsDroppedBeforeAByteIsReadWithOneLogLine) {
-  // Only root can become somebody else to see it.
-  if (::geteuid() != 0) return;
-  UniqueFd given(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  const sa_family_t family = AF_UNIX;
-  ASSERT_EQ(::bind(given.get(), reinterpret_cast<const sockaddr *>(&family), sizeof family), 0);
-  ASSERT_EQ(::listen(given.get(), 8), 0);
-  sockaddr_un address{};
-  socklen_t length = sizeof address;
-  ASSERT_EQ(::getsockname(given.get(), reinterpret_cast<sockaddr *>(&address), &length), 0);
-  activated_.emplace("com.tessel.Storix", std::move(given));
-  const auto socket = openSocket();
+  // The daemon of somebody else: to it this process, which may enter the directory, is foreign.
+  PeerTable peersOfAnother{std::make_shared<ApplicationManifests>(std::vector<std::string>()), ::geteuid() + 1};
+  auto socket = NamedSocket::open({pool_, loop_, peersOfAnother, limit_}, *directory_, activated_, "com.tessel.Storix",
+                                  wire::BusConnection::Descriptors::refused);
+  ASSERT_TRUE(socket);
   Received<bool> accepted;
-  socket->serve([&accepted](const std::shared_ptr<ServedConnection> &) { accepted.put(true); });
-  EXPECT_TRUE(holdsWithoutRoot([&address, length] {
-    const UniqueFd client(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    return ::connect(client.get(), reinterpret_cast<const sockaddr *>(&address), length) == 0 && isClosedByPeer(client);
-  }));
+  socket.value()->serve([&accepted](const std::shared_ptr<ServedConnection> &) { accepted.put(true); });
+  const UniqueFd client = connectTo(pathOf());
+  ASSERT_TRUE(client);
+  EXPECT_TRUE(isClosedByPeer(client));
   EXPECT_EQ(accepted.count(), 0U);
-  EXPECT_THAT(log_.take(), ElementsAre(HasSubstr("Dropped a connection to com.tessel.Storix: ")));
+  EXPECT_THAT(log_.take(),
+              ElementsAre(AllOf(HasSubstr("Dropped a connection to com.tessel.Storix: "),
+                                HasSubstr("The user " + std::to_string(::geteuid()) + " may not connect"))));
 }
 
 TEST(ConnectionLimitTest, DescriptorsAreKeptBack) {
