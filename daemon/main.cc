@@ -61,6 +61,8 @@ storix::Result<std::unique_ptr<LinuxPlatform>> makePlatform(std::vector<std::str
   warnings = environment.value().warnings;
   storix::Result<storix::linuxhost::ActivatedSockets> sockets = storix::linuxhost::takeActivatedSockets();
   if (!sockets) return sockets.error();
+  std::optional<std::string> missing = storix::linuxhost::missingSocketWarning(sockets.value());
+  if (missing) warnings.push_back(*std::move(missing));
   return LinuxPlatform::create(std::move(environment.value()), std::move(sockets.value()));
 }
 

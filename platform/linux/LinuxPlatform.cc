@@ -23,6 +23,16 @@ std::unique_ptr<LogSink> makeLogSink(const HostEnvironment &environment) {
 
 }  // namespace
 
+std::optional<std::string> missingSocketWarning(const ActivatedSockets &activated) {
+  if (activated.empty()) return std::nullopt;
+  for (const std::string_view name : {serviceSocketName, platformSocketName}) {
+    if (activated.contains(name)) continue;
+    return "The service manager hands over no socket with the name " + quotedPath(name) +
+           "; the daemon makes that one itself. Enable both socket units.";
+  }
+  return std::nullopt;
+}
+
 Result<std::unique_ptr<LinuxPlatform>> LinuxPlatform::create(HostEnvironment environment, ActivatedSockets activated) {
   // First of all, since threads inherit which signals are blocked.
   Result<std::unique_ptr<EventLoop>> eventLoop = EventLoop::create();
@@ -72,9 +82,11 @@ std::optional<SXError> LinuxPlatform::openSockets(ActivatedSockets activated) {
   if (!platform) return platform.error();
   platformSocket_ = std::move(platform.value());
   if (!activated.empty()) {
-    return hostError(HostErrorCode::cannotStart, "The service manager hands over a socket with the name " +
-                                                     quotedPath(activated.begin()->first) +
-                                                     ", which nothing here serves; mend its unit.");
+    return hostError(
+        HostErrorCode::cannotStart,
+        "The service manager hands over a socket with the name " + quotedPath(activated.begin()->first) +
+            ", which nothing here serves; its unit must say FileDescriptorName=" + std::string(serviceSocketName) +
+            " or FileDescriptorName=" + std::string(platformSocketName) + ".");
   }
   servePlatformSocket(*platformSocket_, {fileCoordination_, *sandbox_, notifications_});
   return std::nullopt;

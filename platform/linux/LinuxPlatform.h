@@ -29,6 +29,9 @@ namespace storix::linuxhost {
 inline constexpr std::string_view serviceSocketName = "com.tessel.Storix";
 inline constexpr std::string_view platformSocketName = "com.tessel.Platform";
 
+/// A sentence for the log, where the service manager hands over one of the two sockets alone.
+std::optional<std::string> missingSocketWarning(const ActivatedSockets &activated);
+
 /// The Linux host: puts its facilities together, each of which has a file of its own, and hands every
 /// call to the one it belongs to. `main` owns it; the process scope comes and goes within its life.
 class LinuxPlatform final : public PlatformServices {
