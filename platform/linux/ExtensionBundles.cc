@@ -50,27 +50,6 @@ Result<std::vector<std::string>> infoGroups(const Dictionary &info) {
   return groups;
 }
 
-Result<std::shared_ptr<const ExtensionBundle>> readBundle(const std::string &path) {
-  Result<Dictionary> info = readKeyedValueFile(path + "/" + std::string(infoFileName));
-  if (!info) return info.error();
-  auto bundle = std::make_shared<ExtensionBundle>();
-  bundle->path = path;
-  Result<std::string> identifier = infoString(info.value(), "KTBundleIdentifier");
-  if (!identifier) return identifier.error();
-  if (!identifier.value().empty()) bundle->identifier = identifier.value();
-  Result<std::string> version = infoString(info.value(), "KTBundleVersion");
-  if (!version) return version.error();
-  bundle->version = version.value();
-  Result<std::string> extensionPoint = infoString(info.value(), extensionPointAttribute);
-  if (!extensionPoint) return extensionPoint.error();
-  bundle->extensionPoint = extensionPoint.value();
-  Result<std::vector<std::string>> groups = infoGroups(info.value());
-  if (!groups) return groups.error();
-  bundle->groups = groups.value();
-  bundle->info = std::move(info.value());
-  return std::shared_ptr<const ExtensionBundle>(std::move(bundle));
-}
-
 struct CloseDirectory {
   void operator()(DIR *directory) const { ::closedir(directory); }
 };
@@ -134,6 +113,27 @@ class InstalledBundleRecord : public BundleRecord {
 
 }  // namespace
 
+Result<std::shared_ptr<const ExtensionBundle>> readExtensionBundle(const std::string &path) {
+  Result<Dictionary> info = readKeyedValueFile(path + "/" + std::string(infoFileName));
+  if (!info) return info.error();
+  auto bundle = std::make_shared<ExtensionBundle>();
+  bundle->path = path;
+  Result<std::string> identifier = infoString(info.value(), "KTBundleIdentifier");
+  if (!identifier) return identifier.error();
+  if (!identifier.value().empty()) bundle->identifier = identifier.value();
+  Result<std::string> version = infoString(info.value(), "KTBundleVersion");
+  if (!version) return version.error();
+  bundle->version = version.value();
+  Result<std::string> extensionPoint = infoString(info.value(), extensionPointAttribute);
+  if (!extensionPoint) return extensionPoint.error();
+  bundle->extensionPoint = extensionPoint.value();
+  Result<std::vector<std::string>> groups = infoGroups(info.value());
+  if (!groups) return groups.error();
+  bundle->groups = groups.value();
+  bundle->info = std::move(info.value());
+  return std::shared_ptr<const ExtensionBundle>(std::move(bundle));
+}
+
 Result<std::string> ExtensionBundle::executablePath() const {
   const auto found = info.find("KTBundleExecutable");
   const std::string *name = found == info.end() ? nullptr : found->second.string();
@@ -182,7 +182,7 @@ BundleScan scanExtensionBundles(const ExtensionPlaces &places, DirectoryReadingO
     for (const std::string &name : names.value()) {
       const std::string path = stringByAppendingPathComponent(directory, name);
       observer.willReadBundle(path);
-      Result<std::shared_ptr<const ExtensionBundle>> bundle = readBundle(path);
+      Result<std::shared_ptr<const ExtensionBundle>> bundle = readExtensionBundle(path);
       if (!bundle) {
         scan.bundleProblems.push_back({path + "/" + std::string(infoFileName), bundle.error()});
         continue;
@@ -208,6 +208,13 @@ std::vector<BundleProblem> makeGroupContainers(const ExtensionPlaces &places, co
     }
   }
   return problems;
+}
+
+std::vector<std::string> extensionProcessEnvironment(std::vector<std::string> common, const ExtensionBundle &bundle,
+                                                     const std::optional<std::string> &groupContainer) {
+  common.push_back("STORIX_BUNDLE_PATH=" + bundle.path);
+  if (groupContainer) common.push_back("STORIX_GROUP_CONTAINER=" + *groupContainer);
+  return common;
 }
 
 std::shared_ptr<BundleRecord> makeBundleRecord(std::shared_ptr<const ExtensionBundle> bundle,

@@ -61,6 +61,9 @@ struct BundleScan {
   std::vector<BundleProblem> directoryProblems;
 };
 
+/// The bundle in that directory, or what is wrong with its Info.kvs.
+Result<std::shared_ptr<const ExtensionBundle>> readExtensionBundle(const std::string &path);
+
 inline constexpr std::string_view bundleSuffix = ".appdex";
 inline constexpr std::string_view infoFileName = "Info.kvs";
 
@@ -80,6 +83,11 @@ std::string groupContainerPath(const ExtensionPlaces &places, const std::string 
 
 /// Makes the directories of the bundle's groups (0700) that are missing; gives what failed.
 std::vector<BundleProblem> makeGroupContainers(const ExtensionPlaces &places, const ExtensionBundle &bundle);
+
+/// The environment of the bundle's process: `common`, which is that of every extension, and what is its
+/// own. `groupContainer` is the directory of its document group, if it has one.
+std::vector<std::string> extensionProcessEnvironment(std::vector<std::string> common, const ExtensionBundle &bundle,
+                                                     const std::optional<std::string> &groupContainer);
 
 /// The record of one bundle for the logic. `places` gives the group containers.
 std::shared_ptr<BundleRecord> makeBundleRecord(std::shared_ptr<const ExtensionBundle> bundle,

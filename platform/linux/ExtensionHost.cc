@@ -41,11 +41,9 @@ struct ExtensionHost::Implementation : ExtensionSurroundings, std::enable_shared
     LaunchDescription description;
     description.executable = std::move(executable);
     description.workingDirectory = bundle.path;
-    description.environment = environment;
-    description.environment.push_back("STORIX_BUNDLE_PATH=" + bundle.path);
-    if (const std::optional<std::string> group = bundle.documentGroup()) {
-      description.environment.push_back("STORIX_GROUP_CONTAINER=" + groupContainerPath(places, *group));
-    }
+    std::optional<std::string> container = bundle.documentGroup();
+    if (container) container = groupContainerPath(places, *container);
+    description.environment = extensionProcessEnvironment(environment, bundle, container);
     const auto process = std::make_shared<ExtensionProcess>(ExtensionProcess::Surroundings{executor, loop, launcher},
                                                             bundle.identifier.value_or(bundle.path));
     handlers.gone = [weak = weak_from_this()](const std::shared_ptr<ExtensionProcess> &reaped) {
