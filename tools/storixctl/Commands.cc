@@ -1,67 +1,33 @@
 #include "tools/storixctl/Commands.h"
 
-#include <unistd.h>
-
 #include <algorithm>
-#include <array>
 #include <cerrno>
-#include <fstream>
-#include <memory>
 #include <ostream>
 #include <utility>
 
+#include "storix/Client.h"
+#include "tools/storixctl/Advice.h"
 #include "tools/storixctl/Grants.h"
 #include "tools/storixctl/Json.h"
 #include "tools/storixctl/Printed.h"
 #include "tools/storixctl/Requests.h"
+#include "tools/storixctl/Transfers.h"
 
 namespace storix::ctl {
 
 namespace {
 
-/// Copies everything from the descriptor's beginning. The number of bytes, or what failed.
-Result<std::int64_t> copyContent(int descriptor, std::ostream &to) {
-  auto buffer = std::make_unique<std::array<char, std::size_t{256} << 10>>();
-  std::int64_t size = 0;
-  for (;;) {
-    const ssize_t count = ::read(descriptor, buffer->data(), buffer->size());
-    if (count < 0 && errno == EINTR) continue;
-    if (count < 0) return posixError(errno, "reading the document");
-    if (count == 0) break;
-    if (!to.write(buffer->data(), count)) return posixError(EIO, "writing the document's content");
-    size += count;
-  }
-  if (!to.flush()) return posixError(EIO, "writing the document's content");
-  return size;
-}
+bool isReaderGone(const SXError &error) { return error.domain() == posixErrorDomain && error.code() == EPIPE; }
 
-Result<Printed> openDocument(const Invocation &invocation, Client &client, std::ostream &out) {
-  const auto token = fromBase64(invocation.operands[0]);
-  if (!token) return posixError(EINVAL, "reading the token: it must be base64 text, as extend and resolve print it");
-  const auto opened = client.open(*token);
-  if (!opened) return opened.error();
-  const std::string *output = invocation.value(Option::output);
-  if (!output) {
-    const auto copied = copyContent(opened.value().get(), out);
-    if (!copied) return copied.error();
-    return Printed{{}, ""};
+Result<Printed> carryOut(const Invocation &invocation, const Surroundings &surroundings) {
+  if (invocation.verb->verb == Verb::grants) {
+    return grants(invocation, surroundings.homeDirectory, surroundings.outputIsTerminal);
   }
-  std::ofstream file(*output, std::ios::binary | std::ios::trunc);
-  if (!file) return posixError(errno, "opening " + *output);
-  const auto copied = copyContent(opened.value().get(), file);
-  if (!copied) return copied.error();
-  return Printed{{{"output", *output}, {"size", copied.value()}}, ""};
-}
-
-Result<Printed> carryOut(const Invocation &invocation, Client &client, Surroundings &surroundings) {
-  switch (invocation.verb->verb) {
-    case Verb::open:
-      return openDocument(invocation, client, surroundings.out);
-    case Verb::grants:
-      return grants(invocation, surroundings.homeDirectory, surroundings.outputIsTerminal);
-    default:
-      return request(invocation, client, surroundings);
-  }
+  ClientOptions options = surroundings.clientOptions;
+  options.timeout = invocation.timeout;
+  Client client(options);
+  if (movesContent(*invocation.verb)) return moveContent(invocation, client, surroundings);
+  return request(invocation, client, surroundings);
 }
 
 }  // namespace
@@ -72,14 +38,17 @@ std::string printable(std::string text) {
   return text;
 }
 
-ExitStatus runCommand(const Invocation &invocation, Client &client, Surroundings &surroundings) {
+ExitStatus runCommand(const Invocation &invocation, const Surroundings &surroundings) {
   std::ostream &out = surroundings.out;
   std::ostream &err = surroundings.err;
-  const auto printed = carryOut(invocation, client, surroundings);
+  const auto printed = carryOut(invocation, surroundings);
   if (!printed) {
-    if (invocation.json) out << jsonText({{"error", printed.error()}}) << std::flush;
-    err << "storixctl: " << invocation.verb->name << ": " << errorLine(printed.error()) << std::endl;
-    return exitStatusOf(printed.error());
+    if (surroundings.waiting.isInterrupted()) return static_cast<ExitStatus>(128 + surroundings.waiting.signalNumber());
+    if (isReaderGone(printed.error())) return readerGone;
+    const SXError error = adviseOnReaching(printed.error());
+    if (invocation.json) out << jsonText({{"error", error}}) << std::flush;
+    err << "storixctl: " << invocation.verb->name << ": " << errorLine(error) << std::endl;
+    return exitStatusOf(error);
   }
   out << (invocation.json ? jsonText(printed.value().json) : printed.value().text) << std::flush;
   if (!out) {

@@ -1,40 +1,15 @@
 #include "tools/storixctl/Commands.h"
 
-#include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include <fstream>
-#include <iterator>
-#include <sstream>
-
-#include "sdk/src/TestDaemon.h"
-#include "wire/PlatformInterfaces.h"
+#include "tools/storixctl/CommandsTest.h"
 
 namespace storix::ctl {
 namespace {
 
 using ::testing::HasSubstr;
 using ::testing::IsEmpty;
-
-class CommandsTest : public ::testing::Test {
- protected:
-  ExitStatus run(const std::vector<std::string> &arguments,
-                 std::chrono::milliseconds timeout = std::chrono::seconds(60)) {
-    out_.str("");
-    err_.str("");
-    Client client({daemon_.directory(), timeout});
-    return runCommand(std::get<Invocation>(parseArguments(arguments)), client, surroundings_);
-  }
-  std::shared_ptr<sdk::ScriptedDaemon> scripted() { return daemon_.daemon; }
-  std::string printed() const { return out_.str(); }
-  std::string complaint() const { return err_.str(); }
-
-  sdk::TestDaemon daemon_;
-  std::ostringstream out_;
-  std::ostringstream err_;
-  Surroundings surroundings_{"/storage", "", out_, err_};
-};
 
 TEST_F(CommandsTest, WakePrintsNothing) {
   scripted()->onWakeUp = [](const CompletionHandler<> &reply) { reply(); };
@@ -110,40 +85,11 @@ TEST_F(CommandsTest, NoAnswerInTimeIsStatusThree) {
 }
 
 TEST_F(CommandsTest, NoDaemonIsStatusThree) {
-  Client client({daemon_.directory() + "/nowhere", std::chrono::seconds(60)});
-  EXPECT_EQ(runCommand(std::get<Invocation>(parseArguments({"wake", "--json"})), client, surroundings_),
-            daemonNotReachable);
+  surroundings_.clientOptions.runtimeDirectory = daemon_.directory() + "/nowhere";
+  EXPECT_EQ(run({"wake", "--json"}), daemonNotReachable);
   EXPECT_THAT(complaint(), HasSubstr("not running"));
+  EXPECT_THAT(complaint(), HasSubstr("Start storixd"));
   EXPECT_THAT(printed(), HasSubstr("\"domain\": \"com.tessel.storix.client\""));
-}
-
-TEST_F(CommandsTest, OpenPrintsTheContentOrWritesItToAFile) {
-  const std::string path = daemon_.directory() + "/document";
-  const std::string content("hello\0world\n", 12);
-  std::ofstream(path, std::ios::binary) << content;
-  daemon_.onConsume = [&](const wire::MethodValues &values, const wire::BusConnection::Reply &reply) {
-    EXPECT_EQ(std::get<Data>(values.at(0)), Data{"token"});
-    wire::MethodValues answer;
-    answer.emplace_back(UniqueFd(::open(path.c_str(), O_RDWR | O_CLOEXEC)));
-    reply.send(std::move(answer));
-  };
-  EXPECT_EQ(run({"open", "dG9rZW4="}), done);
-  EXPECT_EQ(printed(), content);
-  EXPECT_EQ(run({"open", "dG9rZW4=", "--json", "-o", path + "-copy"}), done);
-  EXPECT_THAT(printed(), HasSubstr("\"size\": 12"));
-  std::ifstream copy(path + "-copy", std::ios::binary);
-  EXPECT_EQ(std::string(std::istreambuf_iterator<char>(copy), {}), content);
-  EXPECT_EQ(run({"open", "dG9rZW4=", "-o", "/nowhere/copy"}), requestFailed);
-  EXPECT_EQ(run({"open", "no token"}), requestFailed);
-  EXPECT_THAT(complaint(), HasSubstr("base64"));
-}
-
-TEST_F(CommandsTest, OpenSaysWhyATokenIsRefused) {
-  daemon_.onConsume = [](const auto &, const wire::BusConnection::Reply &reply) {
-    reply.fail(wire::platformError::invalidToken, "it was changed");
-  };
-  EXPECT_EQ(run({"open", "dG9rZW4="}), requestFailed);
-  EXPECT_THAT(complaint(), HasSubstr("it was changed"));
 }
 
 TEST_F(CommandsTest, BookmarksAreSharedAndResolved) {
@@ -179,9 +125,8 @@ TEST_F(CommandsTest, NotifyPostsTheName) {
 
 TEST_F(CommandsTest, AResultThatCannotBeWrittenIsAFailure) {
   scripted()->onProviders = [](const SXDaemon::ProvidersReply &reply) { reply(std::nullopt, Dictionary{}); };
-  Client client({daemon_.directory(), std::chrono::seconds(60)});
   out_.setstate(std::ios::badbit);
-  EXPECT_EQ(runCommand(std::get<Invocation>(parseArguments({"providers"})), client, surroundings_), requestFailed);
+  EXPECT_EQ(run({"providers"}), requestFailed);
   EXPECT_THAT(complaint(), HasSubstr("could not be written"));
 }
 

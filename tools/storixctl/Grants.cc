@@ -5,37 +5,30 @@
 
 #include "access/AccessControlMap.h"
 #include "platform/linux/KeyedValueFile.h"
+#include "tools/storixctl/Advice.h"
 #include "tools/storixctl/Table.h"
 
 namespace storix::ctl {
 
 namespace {
 
-using linuxhost::keyedValueFormatErrorCode;
-
-SXError withAdvice(const SXError &error, const std::string &advice) {
-  Dictionary details = error.details();
-  details.insert_or_assign("description", error.message() + advice);
-  return SXError(error.domain(), error.code(), std::move(details));
-}
-
 SXError unreadable(const SXError &error, const std::string &path) {
   if (error.domain() == posixErrorDomain && error.code() == ENOENT) {
     return withAdvice(posixError(ENOENT, path),
-                      ". Nothing has been granted yet, or HOME is not that of the user whose daemon it is.");
+                      "Nothing has been granted yet, or HOME is not that of the user whose daemon it is.");
   }
   if (error.domain() != filesErrorDomain) return error;
-  return withAdvice(error,
-                    " Until this is put right the daemon knows no grant; with the next one it starts the file anew and "
-                    "keeps this one as " +
-                        std::string(accessControlFileName) + ".corrupt.");
+  return withAdvice(
+      error,
+      "A daemon that starts with this file knows no grant, and puts a new one in its place with the next: "
+      "put it right, or away, before that.");
 }
 
 Result<AccessControlMap> readMap(const std::string &path) {
   auto content = linuxhost::readKeyedValueFile(path);
   if (!content) return unreadable(content.error(), path);
   auto map = AccessControlMap::fromValue(Value(std::move(content.value())));
-  if (!map) return unreadable(withAdvice(map.error(), " It is " + path + "."), path);
+  if (!map) return unreadable(withAdvice(map.error(), "It is " + path + "."), path);
   return map;
 }
 

@@ -2,6 +2,7 @@
 
 #include <utility>
 
+#include "tools/storixctl/Advice.h"
 #include "tools/storixctl/Json.h"
 #include "tools/storixctl/Table.h"
 
@@ -86,8 +87,11 @@ Result<Printed> request(const Invocation &invocation, Client &client, const Surr
       return outcome(client.wakeUp());
     case Verb::providers:
       return providerList(client.providers(), surroundings.outputIsTerminal);
-    case Verb::resolve:
-      return grantedDocument(client.resolveBookmark(invocation.operands[0]));
+    case Verb::resolve: {
+      const auto granted = client.resolveBookmark(invocation.operands[0]);
+      if (!granted) return adviseOnResolving(granted.error(), invocation.operands[0]);
+      return grantedDocument(granted);
+    }
     case Verb::notify:
       return outcome(client.postNotification(invocation.operands[0]));
     default:

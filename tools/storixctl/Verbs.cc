@@ -10,6 +10,8 @@ const OperandDescription document{"DOCUMENT", "the document: a path, or a file:/
 const OperandDescription provider{"PROVIDER", "identifier of the provider"};
 const OperandDescription consumer{"CONSUMER", "bundle identifier of the application that gets the document"};
 
+const OperandDescription bookmark{"BOOKMARK", "a bookmarkable string, \"storix:PROVIDER/ITEM\""};
+
 constexpr std::string_view whoMayAsk =
     "Needs the entitlement \"com.tessel.storix.acl-read\" or \"com.tessel.storix.acl-write\".\n";
 
@@ -54,6 +56,27 @@ std::span<const VerbDescription> verbs() {
        "Prints one line for each provider: its identifier and the directory where its documents\nappear. Where that is "
        "no terminal, there is a tab between them.\n",
        {}},
+      {Verb::read,
+       "read",
+       "print the content of a document",
+       "Has the document's provider put the content in place, and keeps writers away while it is read.\n"
+       "Any other file is read in the same way.\n",
+       {document},
+       {Option::output}},
+      {Verb::cat,
+       "cat",
+       "print the content of the document that a bookmarkable string names",
+       "As read. The document must have been granted to this program.\n",
+       {bookmark},
+       {Option::output}},
+      {Verb::write,
+       "write",
+       "replace the content of a document",
+       "All of the new content is taken in first. Then, while nobody else reads or writes the document,\n"
+       "it takes the place of the old, with the same permissions, and the document's provider is told.\n"
+       "Until then, whatever fails, the old content stays. A bookmarkable string will do as well.\n",
+       {{"DOCUMENT", "the document: a path, a file:// URL or a bookmarkable string"}},
+       {Option::input}},
       {Verb::extend,
        "extend",
        "grant a document to an application",
@@ -92,7 +115,7 @@ std::span<const VerbDescription> verbs() {
        "find the document that a bookmarkable string names",
        "Prints its URL and the tokens that open it. The document must have been granted to this\nprogram. There is no "
        "answer when the provider is not installed.\n",
-       {{"STRING", "a bookmarkable string, \"storix:PROVIDER/ITEM\""}}},
+       {bookmark}},
       {Verb::grants,
        "grants",
        "list what has been granted to whom",

@@ -6,7 +6,23 @@
 
 namespace storix::ctl {
 
-enum class Verb { wake, providers, extend, placeholder, start, stop, open, share, bookmark, resolve, grants, notify };
+enum class Verb {
+  wake,
+  providers,
+  read,
+  cat,
+  write,
+  extend,
+  placeholder,
+  start,
+  stop,
+  open,
+  share,
+  bookmark,
+  resolve,
+  grants,
+  notify
+};
 
 enum class Option { json, timeout, help, output, input, provider, consumer };
 

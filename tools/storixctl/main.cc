@@ -1,5 +1,7 @@
+#include <fcntl.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <clocale>
 #include <cstdlib>
 #include <filesystem>
@@ -9,12 +11,26 @@
 #include <variant>
 #include <vector>
 
-#include "storix/Client.h"
 #include "tools/storixctl/Arguments.h"
 #include "tools/storixctl/Commands.h"
+#include "tools/storixctl/Transfers.h"
+
+namespace {
+
+/// A standard stream that is closed must not become another name of the next file that is opened:
+/// using it fails instead.
+void occupyClosedStreams() {
+  for (const auto &[descriptor, flags] :
+       {std::pair(STDIN_FILENO, O_WRONLY), std::pair(STDOUT_FILENO, O_RDONLY), std::pair(STDERR_FILENO, O_RDONLY)}) {
+    if (::fcntl(descriptor, F_GETFD) == -1 && errno == EBADF) (void)::open("/dev/null", flags);
+  }
+}
+
+}  // namespace
 
 int main(int count, char **values) {
   using namespace storix::ctl;
+  occupyClosedStreams();
   (void)std::setlocale(LC_CTYPE, "");
   const std::vector<std::string> arguments(values + (count > 0 ? 1 : 0), values + count);
   const ParsedArguments parsed = parseArguments(arguments);
@@ -27,12 +43,16 @@ int main(int count, char **values) {
     return notUnderstood;
   }
   const auto &invocation = std::get<Invocation>(parsed);
-  std::error_code unknown;
-  const std::string currentDirectory = std::filesystem::current_path(unknown).string();
+  ProcessWaiting waiting;
+  if (movesContent(*invocation.verb)) waiting.watchSignals();
   const char *home = std::getenv("HOME");
-  Surroundings surroundings{currentDirectory, home ? home : "", std::cout, std::cerr, ::isatty(STDOUT_FILENO) == 1};
-  storix::ClientOptions options;
-  options.timeout = invocation.timeout;
-  storix::Client client(options);
-  return runCommand(invocation, client, surroundings);
+  std::error_code unknown;
+  return runCommand(invocation, {.currentDirectory = std::filesystem::current_path(unknown).string(),
+                                 .homeDirectory = home ? home : "",
+                                 .clientOptions = {},
+                                 .out = std::cout,
+                                 .err = std::cerr,
+                                 .outputIsTerminal = ::isatty(STDOUT_FILENO) == 1,
+                                 .terminal = ::isatty(STDERR_FILENO) == 1 ? STDERR_FILENO : -1,
+                                 .waiting = waiting});
 }
