@@ -1,5 +1,7 @@
 #include "sdk/src/ClientErrors.h"
 
+#include <utility>
+
 #include "wire/Codec.h"
 
 namespace storix {
@@ -13,6 +15,10 @@ namespace sdk {
 SXError clientError(ClientErrorCode code, std::string sentence, Dictionary details) {
   details.insert_or_assign("description", std::move(sentence));
   return SXError(std::string(clientErrorDomain), static_cast<std::int64_t>(code), std::move(details));
+}
+
+SXError incompleteAnswer(std::string sentence) {
+  return clientError(ClientErrorCode::incompleteAnswer, std::move(sentence));
 }
 
 SXError clientErrorOf(const wire::MethodFailure &failure) {

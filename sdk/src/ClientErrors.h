@@ -2,12 +2,14 @@
 
 #include <string>
 
-#include "storix/Client.h"
+#include "storix/ClientOptions.h"
 #include "wire/Signature.h"
 
 namespace storix::sdk {
 
 SXError clientError(ClientErrorCode code, std::string sentence, Dictionary details = {});
+
+SXError incompleteAnswer(std::string sentence);
 
 /// The error of a request that the daemon answered by a D-Bus error, or whose connection ended.
 SXError clientErrorOf(const wire::MethodFailure &failure);

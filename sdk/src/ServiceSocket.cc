@@ -46,23 +46,30 @@ Result<UniqueFd> connectToSocket(const std::string &path) {
                                                         std::generic_category().message(error));
 }
 
-Result<std::shared_ptr<wire::BusConnection>> ServiceSocket::connection(const std::optional<std::string> &given) {
-  const std::lock_guard lock(mutex_);
-  if (connection_ && connection_->isOpen()) return connection_;
+Result<std::shared_ptr<wire::BusConnection>> connectTo(BusLoop &loop, const std::optional<std::string> &given,
+                                                       const std::string &name, BusLoop::Descriptors descriptors,
+                                                       const std::function<void(wire::BusConnection &)> &prepare) {
   auto directory = runtimeDirectory(given);
   if (!directory) return directory.error();
-  auto socket = connectToSocket(directory.value() + "/" + name_);
+  auto socket = connectToSocket(directory.value() + "/" + name);
   if (!socket) return socket.error();
   wire::BusConnection::Options options;
-  options.descriptors = descriptors_;
-  options.peer = name_;
-  auto added = loop_.add(std::move(socket.value()), std::move(options));
+  options.descriptors = descriptors;
+  options.peer = name;
+  auto added = loop.add(std::move(socket.value()), std::move(options), prepare);
   if (!added) {
     return clientError(ClientErrorCode::notReachable,
                        "The connection to the document broker failed: " + added.error().message());
   }
-  connection_ = added.value();
-  return connection_;
+  return added;
+}
+
+Result<std::shared_ptr<wire::BusConnection>> ServiceSocket::connection(const std::optional<std::string> &given) {
+  const std::lock_guard lock(mutex_);
+  if (connection_ && connection_->isOpen()) return connection_;
+  auto connected = connectTo(loop_, given, name_, descriptors_);
+  if (connected) connection_ = connected.value();
+  return connected;
 }
 
 }  // namespace storix::sdk

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -16,6 +17,13 @@ Result<std::string> runtimeDirectory(const std::optional<std::string> &given);
 
 /// Connects to the unix socket at that path. The error is `notReachable`.
 Result<UniqueFd> connectToSocket(const std::string &path);
+
+/// A new connection to the daemon's socket of that name. `prepare` is for handlers and the like. Errors
+/// are of the client's domain.
+Result<std::shared_ptr<wire::BusConnection>> connectTo(BusLoop &loop,
+                                                       const std::optional<std::string> &runtimeDirectory,
+                                                       const std::string &name, BusLoop::Descriptors descriptors,
+                                                       const std::function<void(wire::BusConnection &)> &prepare = {});
 
 /// One of the daemon's sockets, connected to when it is first used and again when the connection was
 /// lost. Thread-safe.

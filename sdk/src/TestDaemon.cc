@@ -100,7 +100,7 @@ int TestDaemon::listenOn(const std::string &name) {
   if (path.size() >= sizeof address.sun_path) std::abort();
   std::memcpy(address.sun_path, path.data(), path.size());
   const int socket = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
-  if (::bind(socket, reinterpret_cast<const sockaddr *>(&address), sizeof address) != 0 || ::listen(socket, 16) != 0) {
+  if (::bind(socket, reinterpret_cast<const sockaddr *>(&address), sizeof address) != 0 || ::listen(socket, SOMAXCONN) != 0) {
     std::abort();
   }
   return socket;
@@ -141,6 +141,12 @@ void TestDaemon::exportPlatform(wire::BusConnection &connection) const {
   };
   connection.exportMethods(wire::sandboxInterface(), {scripted(onConsume), scripted(onProveWriteAccess)});
   connection.exportMethods(wire::notificationsInterface(), {scripted(onPost)});
+  connection.exportMethods(wire::fileCoordinationInterface(),
+                           {scripted(onBeginRead), scripted(onEndRead), scripted(onBeginWrite), scripted(onEndWrite)});
+  if (onPlatformConnection) onPlatformConnection();
+  if (onPlatformConnectionClosed) {
+    connection.setClosedHandler([closed = onPlatformConnectionClosed](const SXError &) { closed(); });
+  }
 }
 
 }  // namespace storix::sdk

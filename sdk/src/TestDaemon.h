@@ -56,6 +56,12 @@ class TestDaemon {
   wire::BusConnection::MethodHandler onConsume;
   wire::BusConnection::MethodHandler onProveWriteAccess;
   wire::BusConnection::MethodHandler onPost;
+  wire::BusConnection::MethodHandler onBeginRead;
+  wire::BusConnection::MethodHandler onEndRead;
+  wire::BusConnection::MethodHandler onBeginWrite;
+  wire::BusConnection::MethodHandler onEndWrite;
+  std::function<void()> onPlatformConnection;
+  std::function<void()> onPlatformConnectionClosed;
 
   [[nodiscard]] const std::string &directory() const { return directory_; }
   /// Drops every connection; new ones are accepted.

@@ -2,7 +2,6 @@
 
 #include <algorithm>
 #include <chrono>
-#include <functional>
 #include <memory>
 #include <optional>
 #include <stop_token>
@@ -70,10 +69,9 @@ class FileClaim {
 
   /// Ends the claim and waits until the daemon has done so; of a write the file's provider is told then.
   /// Absent on success, and when nothing was held. Errors: `connectionLost` (also when it was lost
-  /// before), `timedOut`. On the thread that runs handlers: EDEADLK, and the claim ends all the same.
+  /// before), `timedOut`. On the thread that runs handlers: EDEADLK, and the claim ends all the same;
+  /// there it is let go of instead.
   [[nodiscard]] std::optional<SXError> end();
-  /// The same with a handler, which runs once on the thread that runs handlers, never inside this call.
-  void end(std::function<void(std::optional<SXError>)> handler);
 
  private:
   friend class sdk::Claim;
