@@ -1,4 +1,4 @@
-#include "examples/folder-provider/FolderProvider.h"
+#include "FolderProvider.h"
 
 #include <fcntl.h>
 #include <rapidjson/document.h>

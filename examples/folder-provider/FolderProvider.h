@@ -6,7 +6,7 @@
 #include <set>
 #include <string>
 
-#include "examples/folder-provider/FolderTree.h"
+#include "FolderTree.h"
 #include "storix/ProviderExtension.h"
 
 namespace storix::example {

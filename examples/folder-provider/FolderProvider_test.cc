@@ -1,4 +1,4 @@
-#include "examples/folder-provider/FolderProvider.h"
+#include "FolderProvider.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -7,7 +7,7 @@
 #include <thread>
 #include <vector>
 
-#include "examples/folder-provider/TemporaryFolder.h"
+#include "TemporaryFolder.h"
 
 namespace storix::example {
 namespace {

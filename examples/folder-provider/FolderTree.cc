@@ -1,4 +1,4 @@
-#include "examples/folder-provider/FolderTree.h"
+#include "FolderTree.h"
 
 #include <dirent.h>
 #include <fcntl.h>
@@ -197,22 +197,32 @@ std::optional<SXError> FolderTree::put(const std::string &path, int file) const 
 }
 
 Result<std::string> FolderTree::putCompanion(const std::string &path, std::string_view text) const {
+  const auto [directory, name] = splitLast(path);
+  const std::string companion = "." + name;
+  if (auto failed = putTextAs(path, companion, text)) return *failed;
+  return directory == "." ? companion : directory + "/" + companion;
+}
+
+std::optional<SXError> FolderTree::putText(const std::string &path, std::string_view text) const {
+  return putTextAs(path, splitLast(path).second, text);
+}
+
+std::optional<SXError> FolderTree::putTextAs(const std::string &path, const std::string &name,
+                                             std::string_view text) const {
   if (auto refused = checkPath(path)) return *refused;
   auto parent = openParentMakingIt(path);
   if (!parent) return parent.error();
   auto incoming = openIncoming();
   if (!incoming) return incoming.error();
   TemporaryFile temporary(incoming.value().get());
-  if (!temporary) return failure(errno, "making a temporary file for the companion of", path);
+  if (!temporary) return failure(errno, "making a temporary file for the text of", path);
   if (int error = writeAll(temporary.fd(), text.data(), text.size())) {
-    return failure(error, "writing the companion of", path);
+    return failure(error, "writing the text of", path);
   }
-  const auto [directory, name] = splitLast(path);
-  const std::string companion = "." + name;
-  if (int error = temporary.renameTo(parent.value().get(), companion)) {
-    return failure(error, "putting in place the companion of", path);
+  if (int error = temporary.renameTo(parent.value().get(), name)) {
+    return failure(error, "putting in place the text of", path);
   }
-  return directory == "." ? companion : directory + "/" + companion;
+  return std::nullopt;
 }
 
 std::optional<SXError> FolderTree::remove(const std::string &path) const {

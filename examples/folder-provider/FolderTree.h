@@ -55,19 +55,26 @@ class FolderTree {
   /// component with a dot in front. Gives the companion's path, relative as well.
   Result<std::string> putCompanion(const std::string &path, std::string_view text) const;
 
+  /// Puts a text under that name, replacing what is there.
+  std::optional<SXError> putText(const std::string &path, std::string_view text) const;
+
   /// Removes the file. One that is not there is no error.
   std::optional<SXError> remove(const std::string &path) const;
 
   /// Removes what an ended process has left half written. Only before work begins.
   void discardIncoming() const;
 
+  /// For who writes files in pieces: the directory that holds the file of that name, made where it is
+  /// missing; and ".incoming", from which the file is then renamed. `path` must have been checked.
+  Result<UniqueFd> openParentMakingIt(const std::string &path) const;
+  Result<UniqueFd> openIncoming() const;
+
  private:
   FolderTree(std::string directory, UniqueFd root) : directory_(std::move(directory)), root_(std::move(root)) {}
 
   SXError failure(int errorNumber, std::string_view doing, std::string_view path) const;
   UniqueFd openBeneath(const std::string &path, int flags) const;
-  Result<UniqueFd> openParentMakingIt(const std::string &path) const;
-  Result<UniqueFd> openIncoming() const;
+  std::optional<SXError> putTextAs(const std::string &path, const std::string &name, std::string_view text) const;
 
   std::string directory_;
   UniqueFd root_;

@@ -1,4 +1,4 @@
-#include "examples/folder-provider/FolderTree.h"
+#include "FolderTree.h"
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
@@ -7,7 +7,7 @@
 
 #include <filesystem>
 
-#include "examples/folder-provider/TemporaryFolder.h"
+#include "TemporaryFolder.h"
 
 namespace storix::example {
 namespace {

@@ -1,3 +1,3 @@
-#include "examples/folder-provider/FolderProvider.h"
+#include "FolderProvider.h"
 
 int main() { return storix::runProviderExtension<storix::example::FolderProvider>(); }
