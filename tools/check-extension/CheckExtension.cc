@@ -1,0 +1,132 @@
+#include "tools/check-extension/CheckExtension.h"
+
+#include <cerrno>
+#include <cstdlib>
+#include <filesystem>
+#include <system_error>
+#include <utility>
+
+#include "platform/linux/ExtensionBundles.h"
+#include "platform/linux/HostEnvironment.h"
+#include "tools/check-extension/CheckBadInput.h"
+#include "tools/check-extension/CheckBundle.h"
+#include "tools/check-extension/CheckItem.h"
+#include "tools/check-extension/CheckedExtension.h"
+
+namespace storix::check {
+
+namespace {
+
+namespace fs = std::filesystem;
+
+/// A fresh directory, removed with its content at the end.
+class WorkingDirectory {
+ public:
+  WorkingDirectory() {
+    std::error_code failed;
+    const fs::path parent = fs::canonical(fs::temp_directory_path(failed), failed);
+    std::string name = (parent / "storix-check-XXXXXX").string();
+    if (!failed && ::mkdtemp(name.data())) path_ = name;
+  }
+  ~WorkingDirectory() {
+    std::error_code ignored;
+    if (!path_.empty()) fs::remove_all(path_, ignored);
+  }
+  WorkingDirectory(const WorkingDirectory &) = delete;
+  WorkingDirectory &operator=(const WorkingDirectory &) = delete;
+
+  [[nodiscard]] const std::string &path() const { return path_; }
+
+ private:
+  std::string path_;
+};
+
+/// What every extension gets of the environment, and a runtime directory without a daemon in it.
+Result<std::vector<std::string>> commonEnvironment(const std::string &runtimeDirectory) {
+  auto variables = linuxhost::processEnvironment();
+  variables.insert_or_assign("STORIX_RUNTIME_DIR", runtimeDirectory);
+  auto host = linuxhost::HostEnvironment::fromVariables(variables);
+  if (!host) return host.error();
+  return host.value().extensionEnvironment;
+}
+
+/// The container of the bundle's document group: the one that was given, or one of the fresh ones.
+Result<std::optional<std::string>> groupContainer(const ExtensionCheck &check, const linuxhost::ExtensionBundle &bundle,
+                                                  const std::string &workingDirectory) {
+  const auto group = bundle.documentGroup();
+  if (!group) return std::optional<std::string>();
+  if (check.container) {
+    std::error_code failed;
+    const fs::path given = fs::canonical(*check.container, failed);
+    if (failed || !fs::is_directory(given, failed)) {
+      return posixError(failed ? failed.value() : ENOTDIR, "using " + *check.container + " as the group's container");
+    }
+    return std::optional(given.string());
+  }
+  linuxhost::ExtensionPlaces places;
+  places.groupContainersDirectory = workingDirectory + "/groups";
+  const auto problems = linuxhost::makeGroupContainers(places, bundle);
+  if (!problems.empty()) return problems.front().error;
+  return std::optional(groupContainerPath(places, *group));
+}
+
+/// Sets the extension up twice, as two starts of the daemon do. Whether there is a directory to go on with.
+bool checkSetup(CheckedExtension &extension, const std::optional<std::string> &storage) {
+  bool answered = false;
+  for (const char *when : {"", "the second time"}) {
+    const auto answer = extension.ask(Operation::performInitialSetup, std::nullopt, when);
+    if (!answer) continue;
+    answered = true;
+    if (const auto failure = failureOf(*answer)) {
+      extension.findings().error("PerformInitialSetup: " + *failure +
+                                 " Without it the daemon leaves the provider out.");
+    }
+  }
+  if (!storage || !answered) return false;
+  std::error_code failed;
+  if (fs::is_directory(*storage, failed)) return true;
+  extension.findings().error(
+      "PerformInitialSetup: the provided-items directory \"Storix Storage\" in the group's "
+      "container is not there afterwards; nobody makes it but the provider.");
+  return fs::create_directory(*storage, failed);
+}
+
+}  // namespace
+
+Result<std::vector<Finding>> checkExtension(const ExtensionCheck &check) {
+  Findings findings;
+  auto bundle = checkBundle(check.bundle, findings);
+  if (!bundle) return findings.all();
+
+  const WorkingDirectory working;
+  if (working.path().empty()) return posixError(errno, "making a temporary directory");
+  auto environment = commonEnvironment(working.path() + "/run");
+  if (!environment) return environment.error();
+  const auto container = groupContainer(check, *bundle->bundle, working.path());
+  if (!container) return container.error();
+  std::optional<std::string> storagePath;
+  if (container.value()) storagePath = *container.value() + "/Storix Storage";
+
+  CheckedExtension extension(
+      {*bundle, extensionProcessEnvironment(environment.value(), *bundle->bundle, container.value()), check.timeout,
+       check.takeOutputLine},
+      findings);
+  if (!extension.start()) return findings.all();
+  if (checkSetup(extension, storagePath)) {
+    const URL storage = *URL::fileURLWithPath(*storagePath, true);
+    checkBadInput(extension, storage, working.path());
+    std::optional<URL> first;
+    std::vector<KnownItem> items;
+    for (const std::string &identifier : check.items) items.push_back({identifier, ""});
+    for (const std::string &path : check.files) items.push_back({std::nullopt, path});
+    for (const KnownItem &item : items) {
+      const auto url = checkItem(extension, item, storage);
+      if (!first) first = url;
+    }
+    checkDescriptors(extension, first, storage);
+  }
+  extension.end(false);
+  return findings.all();
+}
+
+}  // namespace storix::check
