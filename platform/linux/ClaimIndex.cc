@@ -32,7 +32,10 @@ struct ClaimIndex::Node {
   std::set<Number> ownWaiting;
   std::set<Number> tree;
   std::set<Number> treeExclusive;
-  std::set<Number> treeWaiting;
+  std::set<Number> treeWaitingShared;
+  std::set<Number> treeWaitingExclusive;
+
+  std::set<Number> &treeWaiting(Kind kind) { return kind == Kind::shared ? treeWaitingShared : treeWaitingExclusive; }
 };
 
 ClaimIndex::ClaimIndex() : root_(std::make_unique<Node>()) {}
@@ -83,7 +86,7 @@ ClaimIndex::Number ClaimIndex::add(std::string_view path, Kind kind) {
   claim.held = !isBlocked(number, claim);
   if (!claim.held) {
     own->ownWaiting.insert(number);
-    for (Node *node = own; node; node = node->parent) node->treeWaiting.insert(number);
+    for (Node *node = own; node; node = node->parent) node->treeWaiting(kind).insert(number);
   }
   return number;
 }
@@ -105,8 +108,18 @@ bool ClaimIndex::isBlocked(Number number, const Claim &claim) const {
 void ClaimIndex::hold(Number number, Claim &claim, std::vector<Number> &nowHeld) {
   claim.held = true;
   claim.node->ownWaiting.erase(number);
-  for (Node *node = claim.node; node; node = node->parent) node->treeWaiting.erase(number);
+  for (Node *node = claim.node; node; node = node->parent) node->treeWaiting(claim.kind).erase(number);
   nowHeld.push_back(number);
+}
+
+/// Holds those of the waiting claims, after one number and not after another, that nothing blocks.
+void ClaimIndex::holdBetween(Number after, Number last, const std::set<Number> &waiting, std::vector<Number> &nowHeld) {
+  for (auto next = waiting.upper_bound(after); next != waiting.end() && *next <= last;) {
+    const Number candidate = *next;
+    Claim &claim = claims_.find(candidate)->second;
+    if (!isBlocked(candidate, claim)) hold(candidate, claim, nowHeld);
+    next = waiting.upper_bound(candidate);
+  }
 }
 
 std::vector<ClaimIndex::Number> ClaimIndex::remove(Number number) {
@@ -114,6 +127,7 @@ std::vector<ClaimIndex::Number> ClaimIndex::remove(Number number) {
   const auto found = claims_.find(number);
   if (found == claims_.end()) return nowHeld;
   Node *const place = found->second.node;
+  const Kind kind = found->second.kind;
   claims_.erase(found);
   place->own.erase(number);
   place->ownExclusive.erase(number);
@@ -121,11 +135,10 @@ std::vector<ClaimIndex::Number> ClaimIndex::remove(Number number) {
   for (Node *node = place; node; node = node->parent) {
     node->tree.erase(number);
     node->treeExclusive.erase(number);
-    node->treeWaiting.erase(number);
+    node->treeWaiting(kind).erase(number);
   }
 
   // Those that wait above this path: where one of them is blocked, so is every later one on its path.
-  Number firstExclusive = last_ + 1;
   for (Node *node = place->parent; node; node = node->parent) {
     while (!node->ownWaiting.empty()) {
       const Number first = *node->ownWaiting.begin();
@@ -133,17 +146,17 @@ std::vector<ClaimIndex::Number> ClaimIndex::remove(Number number) {
       if (isBlocked(first, claim)) break;
       hold(first, claim, nowHeld);
     }
+  }
+  // Those that wait on it and below it. What is still claimed on the path itself, or above it, bounds
+  // the search, so that no claim is looked at again for each one that ends before its time has come.
+  Number firstOfAny = last_ + 1;
+  Number firstExclusive = last_ + 1;
+  for (Node *node = place; node; node = node->parent) {
+    if (!node->own.empty()) firstOfAny = std::min(firstOfAny, *node->own.begin());
     if (!node->ownExclusive.empty()) firstExclusive = std::min(firstExclusive, *node->ownExclusive.begin());
   }
-  // Those that wait on it and below it. Behind an exclusive claim on the path itself, or above it,
-  // nobody can have come to be held.
-  if (!place->ownExclusive.empty()) firstExclusive = std::min(firstExclusive, *place->ownExclusive.begin());
-  for (auto next = place->treeWaiting.begin(); next != place->treeWaiting.end() && *next <= firstExclusive;) {
-    const Number candidate = *next;
-    Claim &claim = claims_.find(candidate)->second;
-    if (!isBlocked(candidate, claim)) hold(candidate, claim, nowHeld);
-    next = place->treeWaiting.upper_bound(candidate);
-  }
+  holdBetween(number, firstOfAny, place->treeWaitingExclusive, nowHeld);
+  if (kind == Kind::exclusive) holdBetween(number, firstExclusive, place->treeWaitingShared, nowHeld);
   prune(place);
   std::sort(nowHeld.begin(), nowHeld.end());
   return nowHeld;

@@ -55,6 +55,7 @@ class ClaimIndex {
   void prune(Node *node);
   [[nodiscard]] bool isBlocked(Number number, const Claim &claim) const;
   void hold(Number number, Claim &claim, std::vector<Number> &nowHeld);
+  void holdBetween(Number after, Number last, const std::set<Number> &waiting, std::vector<Number> &nowHeld);
 
   std::unique_ptr<Node> root_;
   Number last_ = 0;

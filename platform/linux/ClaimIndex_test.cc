@@ -145,6 +145,33 @@ TEST(ClaimIndexTest, ManyThousandClaimsOnOnePathAreServedOneAfterAnother) {
   }
 }
 
+TEST(ClaimIndexTest, WritersBelowADirectoryWaitForItsManyReadersWithoutBeingLookedAtForEachOfThem) {
+  constexpr std::size_t count = 20000;
+  ClaimIndex index;
+  std::vector<ClaimIndex::Number> readers;
+  std::vector<ClaimIndex::Number> writers;
+  for (std::size_t i = 0; i < count; ++i) readers.push_back(index.add("/home/ada", shared));
+  for (std::size_t i = 0; i < count; ++i) writers.push_back(index.add("/home/ada/" + std::to_string(i), exclusive));
+  for (std::size_t i = 0; i + 1 < count; ++i) ASSERT_THAT(index.remove(readers[i]), IsEmpty());
+  EXPECT_EQ(index.remove(readers.back()), writers);
+}
+
+TEST(ClaimIndexTest, ReadersBelowADirectoryAreLookedAtOnlyAsFarAsItsNextWriter) {
+  constexpr std::size_t count = 20000;
+  ClaimIndex index;
+  std::vector<ClaimIndex::Number> writers;
+  std::vector<ClaimIndex::Number> readers;
+  for (std::size_t i = 0; i < count; ++i) {
+    writers.push_back(index.add("/home/ada", exclusive));
+    readers.push_back(index.add("/home/ada/" + std::to_string(i), shared));
+  }
+  for (std::size_t i = 0; i < count; ++i) {
+    ASSERT_THAT(index.remove(writers[i]), ElementsAre(readers[i]));
+    const auto next = index.remove(readers[i]);
+    ASSERT_EQ(next.size(), i + 1 < count ? 1U : 0U);
+  }
+}
+
 TEST(ClaimIndexTest, ADeepPathIsEnded) {
   std::string path;
   for (int i = 0; i < 30000; ++i) path += "/a";

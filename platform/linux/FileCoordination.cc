@@ -23,6 +23,7 @@ namespace {
 
 using ConnectionNumber = std::uint64_t;
 using QuestionNumber = std::uint64_t;
+using ReaderNumber = std::uint64_t;
 
 /// A registered provider object. What it says of itself is asked once, when it is added.
 struct RegisteredProvider {
@@ -66,17 +67,18 @@ struct Reader {
   ClaimHandler handler;
 };
 
-/// A provider that is asked to provide a file, and those who wait for its answer.
+/// A provider that is asked to provide a file, and those who wait for its answer, in the order in which
+/// they came.
 struct Question {
   std::shared_ptr<RegisteredProvider> provider;
   std::string path;
-  std::vector<Reader> readers;
+  std::map<ReaderNumber, Reader> readers;
 };
 
 struct Connection {
   std::size_t count = 0;  ///< Claims and readers.
   std::set<ClaimIndex::Number> claims;
-  std::set<QuestionNumber> questions;
+  std::set<std::pair<QuestionNumber, ReaderNumber>> readers;
 };
 
 CoordinationFailure unavailable(std::string text) { return {CoordinationFailure::Kind::unavailable, std::move(text)}; }
@@ -141,6 +143,7 @@ class FileCoordination::State : public std::enable_shared_from_this<State> {
   std::map<ClaimIndex::Number, Claim> claims_;
   QuestionNumber lastQuestion_ = 0;
   std::map<QuestionNumber, Question> questions_;
+  ReaderNumber lastReader_ = 0;
   std::map<std::pair<const RegisteredProvider *, std::string>, QuestionNumber> openQuestions_;
   ConnectionNumber lastConnection_ = 0;
   std::map<ConnectionNumber, Connection> connections_;
@@ -281,8 +284,8 @@ void FileCoordination::State::answered(QuestionNumber number, const std::optiona
     question = std::move(found->second);
     questions_.erase(found);
     openQuestions_.erase({question.provider.get(), question.path});
-    for (Reader &reader : question.readers) {
-      connections_.at(reader.place.connection).questions.erase(number);
+    for (auto &[readerNumber, reader] : question.readers) {
+      connections_.at(reader.place.connection).readers.erase({number, readerNumber});
       if (error) {
         discharge(reader.place);
         afterwards.push_back(answering(std::move(reader.handler), *error));
@@ -375,8 +378,8 @@ void FileCoordination::State::begin(ClaimIndex::Kind kind, Place place, ClaimHan
         question.path = place.path;
         newQuestion.emplace(number, provider->urlOf(place.path, place.isDirectory));
       }
-      connections_.at(place.connection).questions.insert(number);
-      question.readers.push_back({std::move(place), std::move(handler)});
+      connections_.at(place.connection).readers.emplace(number, ++lastReader_);
+      question.readers.emplace(lastReader_, Reader{std::move(place), std::move(handler)});
     }
   }
   if (newQuestion) ask(provider, newQuestion->first, std::move(newQuestion->second), party);
@@ -434,13 +437,10 @@ void FileCoordination::State::endConnection(ConnectionNumber number) {
     const std::lock_guard lock(mutex_);
     const auto connection = connections_.extract(number);
     if (connection.empty()) return;
-    for (const QuestionNumber question : connection.mapped().questions) {
-      std::erase_if(questions_.at(question).readers, [this, number, &dropped](Reader &reader) {
-        if (reader.place.connection != number) return false;
-        discharge(reader.place);
-        dropped.push_back(std::move(reader.handler));
-        return true;
-      });
+    for (const auto &[question, readerNumber] : connection.mapped().readers) {
+      const auto reader = questions_.at(question).readers.extract(readerNumber);
+      discharge(reader.mapped().place);
+      dropped.push_back(std::move(reader.mapped().handler));
     }
     std::vector<ClaimIndex::Number> nowHeld;
     for (const ClaimIndex::Number claim : connection.mapped().claims) {

@@ -459,6 +459,32 @@ TEST_F(FileCoordinationTest, ReaderThatGoesWhileTheProviderIsAskedIsForgotten) {
   EXPECT_TRUE(write(*claims_, file("storage/one"))->isHeld());
 }
 
+TEST_F(FileCoordinationTest, ThousandsOfReadersOfOneFileAreServedByOneQuestionAndMayAllGo) {
+  constexpr std::size_t connections = 40;
+  constexpr std::size_t each = 1000;
+  std::vector<std::unique_ptr<FileClaims>> readers;
+  std::size_t held = 0;
+  for (std::size_t i = 0; i < connections; ++i) {
+    readers.push_back(coordination_->claimsOf(nullptr));
+    for (std::size_t j = 0; j < each; ++j) {
+      readers.back()->beginRead(file("storage/one"), std::nullopt, [&held](const ClaimOutcome &outcome) {
+        EXPECT_TRUE(std::holds_alternative<ClaimIdentifier>(outcome));
+        ++held;
+      });
+    }
+  }
+  executor_.runUntilIdle();
+  EXPECT_THAT(provider_->calls, testing::SizeIs(1));
+  readers.resize(connections / 2);
+  answer(0, std::nullopt);
+  EXPECT_EQ(held, connections / 2 * each);
+  const auto writer = write(*claims_, file("storage/one"));
+  EXPECT_FALSE(writer->outcome);
+  readers.clear();
+  executor_.runUntilIdle();
+  EXPECT_TRUE(writer->isHeld());
+}
+
 // --- Writers of a provider's files
 
 TEST_F(FileCoordinationTest, WriterAsksNobodyAndItsEndIsToldToTheProvider) {
