@@ -17,6 +17,7 @@ _storixctl_offer_files() { # -f, or -d for directories alone
 _storixctl_offer_kind() {
   case $1 in
     DOCUMENT | FILE) _storixctl_offer_files -f ;;
+    BUNDLE | DIR) _storixctl_offer_files -d ;;
     PROVIDER) _storixctl_offer < <(storixctl providers --timeout 2 2>/dev/null | cut -f 1) ;;
     CONSUMER) _storixctl_offer < <(storixctl grants 2>/dev/null | cut -f 2 | sort -u) ;;
     NAME) _storixctl_offer <<<com.tessel.mobile.vaultkeepd.first_unlock ;;
@@ -30,10 +31,11 @@ _storixctl() {
     [extend]='DOCUMENT PROVIDER CONSUMER' [placeholder]='DOCUMENT PROVIDER CONSUMER'
     [start]='DOCUMENT PROVIDER CONSUMER' [stop]='DOCUMENT PROVIDER CONSUMER'
     [share]='DOCUMENT CONSUMER' [bookmark]='DOCUMENT' [resolve]='BOOKMARK' [notify]='NAME'
+    [check-extension]='BUNDLE'
   )
   local -A options=(
     [read]='--output -o' [cat]='--output -o' [open]='--output -o' [write]='--input -i'
-    [grants]='--provider --consumer'
+    [grants]='--provider --consumer' [check-extension]='--item --file --container'
   )
   local _storixctl_current=${COMP_WORDS[COMP_CWORD]} verb='' option='' word i
   local -i count=0 optionsEnded=0
@@ -49,7 +51,7 @@ _storixctl() {
     if ((!optionsEnded)) && [[ $word == -?* ]]; then
       case $word in
         --) optionsEnded=1 ;;
-        --timeout | -o | --output | -i | --input | --provider | --consumer)
+        --timeout | -o | --output | -i | --input | --provider | --consumer | --item | --file | --container)
           [[ ${COMP_WORDS[i + 1]-} == = ]] && ((++i))
           ((++i))
           if ((i >= COMP_CWORD)); then option=$word; fi
@@ -66,6 +68,7 @@ _storixctl() {
     -o | --output | -i | --input) _storixctl_offer_kind FILE ;;
     --provider) _storixctl_offer_kind PROVIDER ;;
     --consumer) _storixctl_offer_kind CONSUMER ;;
+    --container) _storixctl_offer_kind DIR ;;
   esac
   [[ -z $option ]] || return 0
 

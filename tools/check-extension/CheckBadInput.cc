@@ -172,6 +172,7 @@ void checkNames(CheckedExtension &extension, const URL &storage) {
   const std::string subject = "a name with spaces, \"%\" and \"\xc3\xa9\"";
   std::vector<CheckedExtension::Question> questions;
   std::map<URL, ExtensionAnswer> answers;
+  bool ledAstray = false;
   for (const char *name : {"a b", "100%", "%20", "\xc3\xa9t\xc3\xa9", "a#b?c", "x/y z", "~", "a:b"}) {
     const URL url = storage.appendingPathComponent(name);
     const auto answer = extension.ask(Operation::itemIdentifier, Value(url), subject);
@@ -180,7 +181,7 @@ void checkNames(CheckedExtension &extension, const URL &storage) {
     for (int i = 0; i < 8; ++i) questions.emplace_back(Operation::itemIdentifier, Value(url));
     if (failureOf(*answer) || !answer->string) continue;
     const auto back = extension.ask(Operation::itemURL, Value(*answer->string), subject);
-    if (back && back->url && *back->url != url) {
+    if (back && back->url && *back->url != url && !std::exchange(ledAstray, true)) {
       extension.findings().error("IdentifierForItemAtURL for " + subject + ": the identifier \"" + *answer->string +
                                  "\" of " + url.absoluteString() + " leads back to " + back->url->absoluteString() +
                                  ".");

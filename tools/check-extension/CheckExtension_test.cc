@@ -333,7 +333,7 @@ TEST_F(CheckExtensionTest, AnIdentifierThatLeadsElsewhereIsNamed) {
   EXPECT_THAT(findingsWithDocument("loses its way back"),
               AllOf(Contains(HasSubstr("its identifier \"a.txt\" leads to ")),
                     Contains("error: IdentifierForItemAtURL for the item \"a.tx\": the identifier of its URL is "
-                             "\"a.txt\".")));
+                             "\"a.txx\".")));
 }
 
 TEST_F(CheckExtensionTest, APlaceholderInTheDocumentsPlaceIsNamed) {

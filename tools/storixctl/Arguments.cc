@@ -100,9 +100,12 @@ std::optional<UsageError> take(const OptionDescription &known, OptionReader &opt
     return std::nullopt;
   }
   if (!value || value->empty()) {
-    return UsageError{option.name + (known.value == "FILE" ? " needs the name of a file" : " needs an identifier")};
+    return UsageError{option.name + (known.value == "ID"     ? " needs an identifier"
+                                     : known.value == "FILE" ? " needs the name of a file"
+                                                             : " needs a path")};
   }
-  invocation.values.insert_or_assign(known.option, *std::move(value));
+  if (!known.mayBeRepeated) invocation.values.erase(known.option);
+  invocation.values.emplace(known.option, *std::move(value));
   return std::nullopt;
 }
 
@@ -117,6 +120,13 @@ UsageError wrongOperandCount(const VerbDescription &verb) {
 const std::string *Invocation::value(Option option) const {
   const auto found = values.find(option);
   return found == values.end() ? nullptr : &found->second;
+}
+
+std::vector<std::string> Invocation::allValues(Option option) const {
+  std::vector<std::string> all;
+  const auto [first, end] = values.equal_range(option);
+  for (auto at = first; at != end; ++at) all.push_back(at->second);
+  return all;
 }
 
 ParsedArguments parseArguments(const std::vector<std::string> &arguments) {
@@ -159,7 +169,7 @@ ParsedArguments parseArguments(const std::vector<std::string> &arguments) {
 std::string helpText(const HelpRequest &request) {
   if (!request.verb) {
     std::string text = "Usage: storixctl VERB [OPTION...] [OPERAND...]\n\nAsks the document broker.\n\nVerbs:\n";
-    for (const auto &verb : verbs()) text += padded(verb.name, 13) + std::string(verb.summary) + "\n";
+    for (const auto &verb : verbs()) text += padded(verb.name, 17) + std::string(verb.summary) + "\n";
     text += "\nOptions:\n" + optionLines(nullptr);
     text += "\n\"storixctl VERB --help\" tells more about a verb. Errors are printed on standard error.\n\n";
     return text + std::string(exitStatuses);

@@ -21,10 +21,12 @@ struct Invocation {
   bool json = false;
   std::chrono::milliseconds timeout{60'000};
   /// Of the options that have one and are not common to all verbs.
-  std::map<Option, std::string> values;
+  std::multimap<Option, std::string> values;
 
   /// Null when the option was not given.
   [[nodiscard]] const std::string *value(Option option) const;
+  /// Of an option that may be repeated, in order.
+  [[nodiscard]] std::vector<std::string> allValues(Option option) const;
 };
 
 /// Help was asked for: of one verb, or of the program.

@@ -51,6 +51,11 @@ TEST(Arguments, OnlyWhatAVerbTakesMayBeGiven) {
   EXPECT_THAT(understood({"open", "-o", "copy", "dG9rZW4="}).values, ElementsAre(Pair(Option::output, "copy")));
   EXPECT_THAT(understood({"grants", "--provider=a", "--consumer", "b"}).values,
               ElementsAre(Pair(Option::provider, "a"), Pair(Option::consumer, "b")));
+  EXPECT_THAT(understood({"open", "-o", "copy", "dG9rZW4=", "-o", "other"}).values,
+              ElementsAre(Pair(Option::output, "other")));
+  EXPECT_THAT(understood({"check-extension", "a", "--item", "1", "--file", "f", "--item=2"}).allValues(Option::item),
+              ElementsAre("1", "2"));
+  EXPECT_EQ(complaint({"check-extension", "a", "--container="}), "--container needs a path");
   EXPECT_EQ(complaint({"wake", "--output=x"}), "\"wake\" takes no --output");
   EXPECT_EQ(complaint({"providers", "--provider=x"}), "\"providers\" takes no --provider");
   EXPECT_EQ(complaint({"grants", "--provider"}), "--provider needs an identifier");

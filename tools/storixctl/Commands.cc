@@ -7,6 +7,7 @@
 
 #include "storix/Client.h"
 #include "tools/storixctl/Advice.h"
+#include "tools/storixctl/BundleCheck.h"
 #include "tools/storixctl/Grants.h"
 #include "tools/storixctl/Json.h"
 #include "tools/storixctl/Printed.h"
@@ -23,6 +24,7 @@ Result<Printed> carryOut(const Invocation &invocation, const Surroundings &surro
   if (invocation.verb->verb == Verb::grants) {
     return grants(invocation, surroundings.homeDirectory, surroundings.outputIsTerminal);
   }
+  if (invocation.verb->verb == Verb::checkExtension) return checkBundle(invocation, surroundings);
   ClientOptions options = surroundings.clientOptions;
   options.timeout = invocation.timeout;
   Client client(options);
@@ -55,7 +57,7 @@ ExitStatus runCommand(const Invocation &invocation, const Surroundings &surround
     err << "storixctl: " << invocation.verb->name << ": the result could not be written" << std::endl;
     return requestFailed;
   }
-  return done;
+  return printed.value().isFailure ? requestFailed : done;
 }
 
 ExitStatus exitStatusOf(const SXError &error) {

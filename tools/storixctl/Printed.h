@@ -11,6 +11,8 @@ namespace storix::ctl {
 struct Printed {
   Dictionary json;
   std::string text;
+  /// The exit status says that something is wrong, and this tells what.
+  bool isFailure = false;
 };
 
 /// Names and paths come from elsewhere and could hold what a terminal obeys: control characters

@@ -26,6 +26,9 @@ std::span<const OptionDescription> options() {
       {Option::input, "--input", "-i", "FILE", "where the content comes from, instead of standard input"},
       {Option::provider, "--provider", "", "ID", "only what this provider's documents were granted to"},
       {Option::consumer, "--consumer", "", "ID", "only what this application was granted"},
+      {Option::item, "--item", "", "ID", "try this document, named by its identifier (repeatable)", true},
+      {Option::file, "--file", "", "PATH", "the same, named by its path among the provided items (repeatable)", true},
+      {Option::container, "--container", "", "DIR", "the group's container, where a fresh one will not do"},
   };
   return all;
 }
@@ -129,6 +132,15 @@ std::span<const VerbDescription> verbs() {
        "post a system notification",
        "Prints nothing.\n",
        {{"NAME", "the notification's name, such as com.tessel.mobile.vaultkeepd.first_unlock"}}},
+      {Verb::checkExtension,
+       "check-extension",
+       "tell what is wrong with a document provider's bundle",
+       "Starts the provider as the daemon would, but without a daemon and in a fresh group container,\n"
+       "and asks it for everything good and bad that may be asked. Prints errors and advice, and what\n"
+       "the provider prints. Name documents of the provider, or only bad input can be tried. They are\n"
+       "downloaded and dropped, and not changed. Exit status 1 where there are errors.\n",
+       {{"BUNDLE", "the bundle, NAME.appdex"}},
+       {Option::item, Option::file, Option::container}},
   };
   return all;
 }

@@ -21,10 +21,11 @@ enum class Verb {
   bookmark,
   resolve,
   grants,
-  notify
+  notify,
+  checkExtension
 };
 
-enum class Option { json, timeout, help, output, input, provider, consumer };
+enum class Option { json, timeout, help, output, input, provider, consumer, item, file, container };
 
 struct OptionDescription {
   Option option;
@@ -32,6 +33,7 @@ struct OptionDescription {
   std::string_view shortName;  ///< "-o", or empty
   std::string_view value;      ///< what its value is, as in "FILE"; empty for one that takes none
   std::string_view meaning;    ///< one line
+  bool mayBeRepeated = false;  ///< else the last one counts
 };
 
 /// All options, those of every verb first.
