@@ -22,16 +22,12 @@ bool isPlainName(std::string_view name) {
          name.find('\0') == std::string_view::npos;
 }
 
-SXError malformed(const std::string &reason) {
-  return SXError(std::string(filesErrorDomain), keyedValueFormatErrorCode, {{"description", reason}});
-}
-
 /// The string of that key; empty where it is missing, an error where it is something else.
 Result<std::string> infoString(const Dictionary &info, std::string_view key) {
   const auto found = info.find(key);
   if (found == info.end()) return std::string();
   if (const std::string *text = found->second.string()) return *text;
-  return malformed("\"" + std::string(key) + "\" must be a string.");
+  return keyedValueFormatError("\"" + std::string(key) + "\" must be a string.");
 }
 
 Result<std::vector<std::string>> infoGroups(const Dictionary &info) {
@@ -39,11 +35,11 @@ Result<std::vector<std::string>> infoGroups(const Dictionary &info) {
   const auto found = info.find("KTGroupContainers");
   if (found == info.end()) return groups;
   const List *list = found->second.list();
-  if (!list) return malformed("\"KTGroupContainers\" must be a list.");
+  if (!list) return keyedValueFormatError("\"KTGroupContainers\" must be a list.");
   for (const Value &entry : *list) {
     const std::string *group = entry.string();
     if (!group || !isPlainName(*group)) {
-      return malformed("\"KTGroupContainers\" must hold group identifiers, which are plain names.");
+      return keyedValueFormatError("\"KTGroupContainers\" must hold group identifiers, which are plain names.");
     }
     if (std::find(groups.begin(), groups.end(), *group) == groups.end()) groups.push_back(*group);
   }
@@ -130,6 +126,9 @@ Result<std::shared_ptr<const ExtensionBundle>> readExtensionBundle(const std::st
   Result<std::vector<std::string>> groups = infoGroups(info.value());
   if (!groups) return groups.error();
   bundle->groups = groups.value();
+  Result<ConfinementWishes> wishes = confinementWishes(info.value());
+  if (!wishes) return wishes.error();
+  bundle->wishes = std::move(wishes.value());
   bundle->info = std::move(info.value());
   return std::shared_ptr<const ExtensionBundle>(std::move(bundle));
 }

@@ -9,6 +9,7 @@
 
 #include "platform/Extensions.h"
 #include "platform/Result.h"
+#include "platform/linux/ConfinementWishes.h"
 
 namespace storix::linuxhost {
 
@@ -27,6 +28,7 @@ struct ExtensionBundle {
   std::string version;
   std::string extensionPoint;
   std::vector<std::string> groups;
+  ConfinementWishes wishes;
   /// The whole content of Info.kvs.
   Dictionary info;
 

@@ -73,6 +73,13 @@ TEST_F(ExtensionBundlesTest, EveryFieldOfABundleIsRead) {
   EXPECT_EQ(bundle.executablePath().value(), directory_ / "a/docs.appdex/run");
 }
 
+TEST_F(ExtensionBundlesTest, WishesForTheSandboxAreReadAndOnesThatAreMalformedLeaveTheBundleOut) {
+  install("b/good", R"({"KTSandbox": {"network": true, "readOnly": ["~/Music"]}})");
+  EXPECT_EQ(scan().bundles.at(0)->wishes, (ConfinementWishes{true, {"~/Music"}, {}}));
+  std::filesystem::remove_all(directory_ / "b");
+  EXPECT_EQ(problemOf(R"({"KTSandbox": {"network": 1}})"), "\"network\" in \"KTSandbox\" must be true or false.");
+}
+
 TEST_F(ExtensionBundlesTest, BundlesComeInTheOrderOfDirectoriesThenOfNames) {
   install("b/a", R"({"KTBundleIdentifier": "1"})");
   install("a/z", R"({"KTBundleIdentifier": "2"})");

@@ -24,11 +24,12 @@ constexpr std::chrono::seconds timeAfterKill{5};
 
 struct ExtensionHost::Implementation : ExtensionSurroundings, std::enable_shared_from_this<Implementation> {
   Implementation(ExtensionPlaces initialPlaces, std::vector<std::string> initialEnvironment, Executor &initialExecutor,
-                 IoLoop &initialLoop)
+                 IoLoop &initialLoop, std::unique_ptr<ExtensionConfinement> initialConfinement)
       : places(std::move(initialPlaces)),
         environment(std::move(initialEnvironment)),
         executor(initialExecutor),
-        loop(initialLoop) {}
+        loop(initialLoop),
+        confinement(std::move(initialConfinement)) {}
 
   std::optional<ExtensionContextClass> contextClass(std::string_view name) override {
     const std::lock_guard lock(mutex);
@@ -44,6 +45,11 @@ struct ExtensionHost::Implementation : ExtensionSurroundings, std::enable_shared
     std::optional<std::string> container = bundle.documentGroup();
     if (container) container = groupContainerPath(places, *container);
     description.environment = extensionProcessEnvironment(environment, bundle, container);
+    if (confinement) {
+      // The launcher goes before the confinement does.
+      description.prepare = [this, confined = std::make_shared<const ExtensionBundle>(bundle)](
+                                LaunchDescription &prepared) { return confinement->confine(prepared, *confined); };
+    }
     const auto process = std::make_shared<ExtensionProcess>(ExtensionProcess::Surroundings{executor, loop, launcher},
                                                             bundle.identifier.value_or(bundle.path));
     handlers.gone = [weak = weak_from_this()](const std::shared_ptr<ExtensionProcess> &reaped) {
@@ -89,6 +95,7 @@ struct ExtensionHost::Implementation : ExtensionSurroundings, std::enable_shared
   const std::vector<std::string> environment;
   Executor &executor;
   IoLoop &loop;
+  const std::unique_ptr<ExtensionConfinement> confinement;
   ExtensionLauncher launcher;
 
   std::mutex mutex;
@@ -101,8 +108,9 @@ struct ExtensionHost::Implementation : ExtensionSurroundings, std::enable_shared
 };
 
 ExtensionHost::ExtensionHost(ExtensionPlaces places, std::vector<std::string> environment, Executor &executor,
-                             IoLoop &loop)
-    : implementation_(std::make_shared<Implementation>(places, std::move(environment), executor, loop)) {
+                             IoLoop &loop, std::unique_ptr<ExtensionConfinement> confinement)
+    : implementation_(
+          std::make_shared<Implementation>(places, std::move(environment), executor, loop, std::move(confinement))) {
   implementation_->discovery = std::make_unique<ExtensionDiscovery>(
       std::move(places), executor, loop,
       [&executor, weak = std::weak_ptr(implementation_)](std::shared_ptr<const ExtensionBundle> bundle) {

@@ -11,6 +11,7 @@
 #include "platform/Executor.h"
 #include "platform/Extensions.h"
 #include "platform/linux/ExtensionBundles.h"
+#include "platform/linux/ExtensionConfinement.h"
 #include "platform/linux/IoLoop.h"
 
 namespace storix::linuxhost {
@@ -20,8 +21,10 @@ namespace storix::linuxhost {
 class ExtensionHost {
  public:
   /// `environment` is what every extension gets, as "NAME=value", beside what is its own. `executor` and
-  /// `loop` must outlive the host and its records.
-  ExtensionHost(ExtensionPlaces places, std::vector<std::string> environment, Executor &executor, IoLoop &loop);
+  /// `loop` must outlive the host and its records. Without a confinement extensions run with all that
+  /// their user may do.
+  ExtensionHost(ExtensionPlaces places, std::vector<std::string> environment, Executor &executor, IoLoop &loop,
+                std::unique_ptr<ExtensionConfinement> confinement = nullptr);
 
   /// Ends discovery and all processes, and waits until they are reaped: SIGTERM, then SIGKILL after
   /// two seconds.

@@ -102,11 +102,12 @@ class ExtensionHostTest : public ::testing::Test {
  protected:
   ExtensionHostTest() { makeHost(true); }
 
-  void makeHost(bool withContextClass) {
+  void makeHost(bool withContextClass, std::unique_ptr<ExtensionConfinement> confinement = nullptr) {
     host_.reset();
     host_ = std::make_unique<ExtensionHost>(
         ExtensionPlaces{{directory_ / "extensions"}, directory_ / "groups"},
-        std::vector<std::string>{"HOME=/home/u", "PATH=/bin", "STORIX_RUNTIME_DIR=/run/x"}, time_, loop_);
+        std::vector<std::string>{"HOME=/home/u", "PATH=/bin", "STORIX_RUNTIME_DIR=/run/x"}, time_, loop_,
+        std::move(confinement));
     if (!withContextClass) return;
     host_->registerExtensionContextClass("_KTStorixExtensionHostContext",
                                          {[]() -> const LinkInterface & { return vendorInterface(); },
@@ -129,7 +130,7 @@ class ExtensionHostTest : public ::testing::Test {
                             R"(", "KTExtensionPointIdentifier": "point", "KTBundleExecutable": ")" + behaviour + "\"" +
                             more + "}");
     if (!std::filesystem::exists(directory_ / (bundle + "/" + behaviour))) {
-      directory_.makeLink(bundle + "/" + behaviour, STORIX_TEST_EXTENSION);
+      std::filesystem::copy_file(STORIX_TEST_EXTENSION, directory_ / (bundle + "/" + behaviour));
     }
     return directory_ / bundle;
   }

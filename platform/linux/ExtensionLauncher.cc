@@ -18,8 +18,7 @@ namespace storix::linuxhost {
 
 namespace {
 
-/// Descriptors that the child is to have are kept above those that they get in the child.
-constexpr int firstFreeNumber = launchedSocketNumber + 1;
+constexpr int firstNumberAfterSocket = launchedSocketNumber + 1;
 
 /// All that the child needs, made before the fork: between fork and exec nothing may allocate.
 struct ChildPlan {
@@ -30,6 +29,9 @@ struct ChildPlan {
   int input;
   int output;
   int socket;
+  /// They become `firstNumberAfterSocket` and so on.
+  const int *descriptors;
+  int descriptorCount;
   int failure;
   pid_t parent;
 };
@@ -50,7 +52,12 @@ struct ChildPlan {
       ::dup2(plan.output, STDERR_FILENO) < 0 || ::dup2(plan.socket, launchedSocketNumber) < 0) {
     giveUp(plan.failure);
   }
-  if (::syscall(SYS_close_range, firstFreeNumber, ~0U, CLOSE_RANGE_CLOEXEC) != 0) giveUp(plan.failure);
+  for (int i = 0; i < plan.descriptorCount; ++i) {
+    if (::dup2(plan.descriptors[i], firstNumberAfterSocket + i) < 0) giveUp(plan.failure);
+  }
+  if (::syscall(SYS_close_range, firstNumberAfterSocket + plan.descriptorCount, ~0U, CLOSE_RANGE_CLOEXEC) != 0) {
+    giveUp(plan.failure);
+  }
   if (::chdir(plan.workingDirectory) != 0) giveUp(plan.failure);
   struct sigaction action = {};
   action.sa_handler = SIG_DFL;
@@ -77,27 +84,37 @@ Result<Pipe> makePipe() {
   return made;
 }
 
-/// The same, under a number that does not stand in the way in the child.
-Result<UniqueFd> moved(UniqueFd fd) {
+/// The same, under a number that does not stand in the way of those that the child is to have.
+Result<UniqueFd> moved(UniqueFd fd, int firstFreeNumber) {
   if (fd.get() >= firstFreeNumber) return fd;
   UniqueFd copy(::fcntl(fd.get(), F_DUPFD_CLOEXEC, firstFreeNumber));
   if (!copy) return posixError(errno, "preparing an extension's descriptors");
   return copy;
 }
 
-Result<LaunchedProcess> start(LaunchDescription description) {
+}  // namespace
+
+Result<LaunchedProcess> launchProcess(LaunchDescription description) {
   Result<Pipe> output = makePipe();
   if (!output) return output.error();
   Result<Pipe> failure = makePipe();
   if (!failure) return failure.error();
-  Result<UniqueFd> childOutput = moved(std::move(output.value().writing));
-  Result<UniqueFd> childFailure = moved(std::move(failure.value().writing));
-  Result<UniqueFd> childSocket = moved(std::move(description.socket));
+  const int firstFreeNumber = firstNumberAfterSocket + static_cast<int>(description.descriptors.size());
+  Result<UniqueFd> childOutput = moved(std::move(output.value().writing), firstFreeNumber);
+  Result<UniqueFd> childFailure = moved(std::move(failure.value().writing), firstFreeNumber);
+  Result<UniqueFd> childSocket = moved(std::move(description.socket), firstFreeNumber);
   UniqueFd null(::open("/dev/null", O_RDONLY | O_CLOEXEC));
   if (!null) return posixError(errno, "opening /dev/null");
-  Result<UniqueFd> childInput = moved(std::move(null));
+  Result<UniqueFd> childInput = moved(std::move(null), firstFreeNumber);
   for (const auto *descriptor : {&childOutput, &childFailure, &childSocket, &childInput}) {
     if (!descriptor->ok()) return descriptor->error();
+  }
+  std::vector<int> childDescriptors;
+  for (UniqueFd &descriptor : description.descriptors) {
+    Result<UniqueFd> placed = moved(std::move(descriptor), firstFreeNumber);
+    if (!placed) return placed.error();
+    descriptor = std::move(placed.value());
+    childDescriptors.push_back(descriptor.get());
   }
 
   description.environment.push_back("STORIX_EXTENSION_FD=" + std::to_string(launchedSocketNumber));
@@ -105,7 +122,9 @@ Result<LaunchedProcess> start(LaunchDescription description) {
   environment.reserve(description.environment.size() + 1);
   for (std::string &variable : description.environment) environment.push_back(variable.data());
   environment.push_back(nullptr);
-  std::array<char *, 2> arguments{description.executable.data(), nullptr};
+  std::vector<char *> arguments = {description.executable.data()};
+  for (std::string &argument : description.arguments) arguments.push_back(argument.data());
+  arguments.push_back(nullptr);
 
   const ChildPlan plan{description.executable.c_str(),
                        description.workingDirectory.c_str(),
@@ -114,6 +133,8 @@ Result<LaunchedProcess> start(LaunchDescription description) {
                        childInput.value().get(),
                        childOutput.value().get(),
                        childSocket.value().get(),
+                       childDescriptors.data(),
+                       static_cast<int>(childDescriptors.size()),
                        childFailure.value().get(),
                        ::getpid()};
 
@@ -140,10 +161,9 @@ Result<LaunchedProcess> start(LaunchDescription description) {
   }
   process.output = std::move(output.value().reading);
   process.execFailure = std::move(failure.value().reading);
+  process.isConfined = description.isConfined;
   return process;
 }
-
-}  // namespace
 
 ExtensionLauncher::ExtensionLauncher() : thread_(&ExtensionLauncher::run, this) {}
 
@@ -158,7 +178,15 @@ ExtensionLauncher::~ExtensionLauncher() {
 
 void ExtensionLauncher::launch(LaunchDescription description, Handler handler) {
   auto work = [description = std::make_shared<LaunchDescription>(std::move(description)),
-               handler = std::move(handler)] { handler(start(std::move(*description))); };
+               handler = std::move(handler)] {
+    if (const auto prepare = std::exchange(description->prepare, nullptr)) {
+      if (const std::optional<SXError> error = prepare(*description)) {
+        handler(*error);
+        return;
+      }
+    }
+    handler(launchProcess(std::move(*description)));
+  };
   {
     const std::lock_guard lock(mutex_);
     work_.push_back(std::move(work));

@@ -26,6 +26,9 @@ namespace {
 constexpr std::size_t outputAtATime = 64 * 1024;
 constexpr std::size_t outputAfterExit = 1024 * 1024;
 
+/// The program that confines another one adds the number of the signal that has ended that one.
+constexpr int signalStatusBase = 128;
+
 std::string signalText(int signal) {
   const char *description = ::sigdescr_np(signal);
   return std::to_string(signal) + (description ? " (" + std::string(description) + ")" : std::string());
@@ -92,6 +95,7 @@ void ExtensionProcess::launched(LaunchedProcess process) {
     processIdentifier_ = process.processIdentifier;
     pidfd_ = std::move(process.pidfd);
     execFailure_ = std::move(process.execFailure);
+    isConfined_ = process.isConfined;
     exitWatch_ = surroundings_.loop.watch(pidfd_.get(), EPOLLIN, [weak = weak_from_this()](std::uint32_t) {
       if (const auto self = weak.lock()) self->reapIfExited();
     });
@@ -315,17 +319,20 @@ void ExtensionProcess::reapIfExited() {
 SXError ExtensionProcess::exitCause(int code, int status) const {
   int execError = 0;
   if (execFailure_ && ::read(execFailure_.get(), &execError, sizeof(execError)) == sizeof(execError)) {
-    return posixError(execError, "The program " + executable_ + " of the extension " + name_ + " could not be run");
+    return programError(execError, executable_, name_);
   }
+  const bool tellsOfSignal =
+      isConfined_ && code == CLD_EXITED && status > signalStatusBase && status < signalStatusBase + NSIG;
   const std::string when = wasReady_ ? "." : ", before it had logged in.";
-  if (code == CLD_EXITED) {
+  if (code == CLD_EXITED && !tellsOfSignal) {
     return SXError(std::string(platformErrorDomain), static_cast<std::int64_t>(HostErrorCode::extensionExited),
                    {{"description",
                      "The process of the extension " + name_ + " exited with status " + std::to_string(status) + when},
                     {"status", status}});
   }
-  return hostError(HostErrorCode::extensionKilled,
-                   "The process of the extension " + name_ + " was killed by signal " + signalText(status) + when);
+  return hostError(HostErrorCode::extensionKilled, "The process of the extension " + name_ + " was killed by signal " +
+                                                       signalText(tellsOfSignal ? status - signalStatusBase : status) +
+                                                       when);
 }
 
 void ExtensionProcess::settle(const SXError &cause, bool isFailure) {

@@ -113,6 +113,7 @@ class ExtensionProcess : public std::enable_shared_from_this<ExtensionProcess> {
   std::optional<SXError> cause_;
   std::vector<std::function<void(SXError)>> awaitingCause_;
   pid_t processIdentifier_ = 0;
+  bool isConfined_ = false;
   UniqueFd pidfd_;
   UniqueFd execFailure_;
   UniqueFd socket_;  ///< Until the connection has it.

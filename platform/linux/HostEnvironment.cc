@@ -141,6 +141,15 @@ void readLogSettings(const Reader &reader, HostEnvironment &environment) {
   }
 }
 
+void readConfinement(const Reader &reader, HostEnvironment &environment) {
+  const std::string word = reader.text("STORIX_CONFINEMENT");
+  if (word.empty() || word == "preferred") return;
+  environment.confinement = word == "off" ? ConfinementPolicy::off : ConfinementPolicy::required;
+  if (word == "off" || word == "required") return;
+  environment.warnings.push_back("STORIX_CONFINEMENT is “" + escapedForLog(word) +
+                                 "”, which is none of off, preferred and required; required is used.");
+}
+
 std::vector<std::string> environmentForExtensions(const EnvironmentVariables &variables,
                                                   const HostEnvironment &environment) {
   std::vector<std::string> entries = {"HOME=" + environment.homeDirectory,
@@ -174,6 +183,8 @@ Result<HostEnvironment> HostEnvironment::fromVariables(const EnvironmentVariable
   if (!runtime) return runtime.error();
   environment.runtimeDirectory = std::move(runtime.value());
   readPlaces(reader, environment);
+  environment.sessionRuntimeDirectory = reader.xdgDirectory("XDG_RUNTIME_DIR");
+  readConfinement(reader, environment);
   readLogSettings(reader, environment);
   environment.extensionEnvironment = environmentForExtensions(variables, environment);
   return environment;

@@ -8,6 +8,7 @@
 #include "platform/Log.h"
 #include "platform/Result.h"
 #include "platform/linux/ExtensionBundles.h"
+#include "platform/linux/ExtensionConfinement.h"
 
 namespace storix::linuxhost {
 
@@ -22,7 +23,10 @@ EnvironmentVariables processEnvironment();
 struct HostEnvironment {
   std::string homeDirectory;
   std::string runtimeDirectory;
+  /// Where the session's other services have their sockets; empty when it is not known.
+  std::string sessionRuntimeDirectory;
   ExtensionPlaces extensionPlaces;
+  ConfinementPolicy confinement = ConfinementPolicy::preferred;
   /// Of application manifests, in the order of precedence.
   std::vector<std::string> applicationDirectories;
   LogSeverity logSeverity = LogSeverity::standard;

@@ -125,6 +125,25 @@ TEST(HostEnvironmentTest, UnknownLogLevelIsDefaultWithOneWarning) {
               ElementsAre(AllOf(HasSubstr("STORIX_LOG is “loud\\x1b”"), HasSubstr("default is used"))));
 }
 
+TEST(HostEnvironment, ConfinementIsRequiredWhereTheWordIsNotUnderstood) {
+  EXPECT_EQ(read(with({})).confinement, ConfinementPolicy::preferred);
+  EXPECT_EQ(read(with({{"STORIX_CONFINEMENT", ""}})).confinement, ConfinementPolicy::preferred);
+  EXPECT_EQ(read(with({{"STORIX_CONFINEMENT", "preferred"}})).confinement, ConfinementPolicy::preferred);
+  EXPECT_EQ(read(with({{"STORIX_CONFINEMENT", "off"}})).confinement, ConfinementPolicy::off);
+  EXPECT_EQ(read(with({{"STORIX_CONFINEMENT", "required"}})).confinement, ConfinementPolicy::required);
+  const HostEnvironment environment = read(with({{"STORIX_CONFINEMENT", "of\n"}}));
+  EXPECT_EQ(environment.confinement, ConfinementPolicy::required);
+  EXPECT_THAT(
+      environment.warnings,
+      ElementsAre("STORIX_CONFINEMENT is “of\\n”, which is none of off, preferred and required; required is used."));
+}
+
+TEST(HostEnvironment, SessionsRuntimeDirectoryIsKnownWhereverTheSocketsAre) {
+  EXPECT_EQ(read(with({{"XDG_RUNTIME_DIR", "/run/user/7/"}, {"STORIX_RUNTIME_DIR", "/x"}})).sessionRuntimeDirectory,
+            "/run/user/7");
+  EXPECT_EQ(read(with({{"XDG_RUNTIME_DIR", "relative"}, {"STORIX_RUNTIME_DIR", "/x"}})).sessionRuntimeDirectory, "");
+}
+
 TEST(HostEnvironmentTest, JournalIsUsedWhenStandardErrorIsItsStream) {
   struct stat status {};
   ASSERT_EQ(::fstat(STDERR_FILENO, &status), 0);

@@ -21,6 +21,8 @@ enum class HostErrorCode : std::int64_t {
   startingTooOften = 6,  ///< it failed so often that it is left alone for a while
   hostEnding = 7,        ///< the daemon is about to end
   cannotStart = 9,       ///< what the daemon needs in order to start cannot be used; the text says what to do
+  cannotConfine = 11,    ///< extensions may only run confined, and that does not work here
+  notGranted = 12,       ///< an extension asks for a place that it may not have
   noAnswer = 10,         ///< a provider let go of a question without answering it
 };
 
@@ -28,6 +30,11 @@ enum class HostErrorCode : std::int64_t {
 inline SXError hostError(HostErrorCode code, std::string description) {
   return SXError(std::string(platformErrorDomain), static_cast<std::int64_t>(code),
                  {{"description", Value(std::move(description))}});
+}
+
+/// The program of an extension cannot be run.
+inline SXError programError(int errorNumber, const std::string &executable, const std::string &extension) {
+  return posixError(errorNumber, "The program " + executable + " of the extension " + extension + " could not be run");
 }
 
 }  // namespace storix::linuxhost

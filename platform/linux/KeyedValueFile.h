@@ -4,6 +4,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <utility>
 
 #include "platform/Result.h"
 #include "platform/SXError.h"
@@ -24,6 +25,11 @@ inline constexpr std::size_t keyedValueSizeLimit = std::size_t{256} << 20;
 /// Text that is not keyed-value text has this code in `filesErrorDomain`; a failure to read or write
 /// it is a "posix" error.
 inline constexpr std::int64_t keyedValueFormatErrorCode = 2;
+
+/// For whoever finds something wrong in what such a text says.
+inline SXError keyedValueFormatError(std::string reason) {
+  return SXError(std::string(filesErrorDomain), keyedValueFormatErrorCode, {{"description", Value(std::move(reason))}});
+}
 
 /// Reads from where the descriptor stands to the end. `name` is what error texts call it.
 Result<Dictionary> readKeyedValues(int fd, std::string_view name, std::size_t sizeLimit = keyedValueSizeLimit);

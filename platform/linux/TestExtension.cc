@@ -2,7 +2,11 @@
 // which it was started, what it does with a request by the last component of the item's URL.
 
 #include <dirent.h>
+#include <fcntl.h>
+#include <netinet/in.h>
 #include <sys/prctl.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <systemd/sd-bus.h>
 #include <unistd.h>
 
@@ -66,6 +70,81 @@ std::string directoryText() {
   return ::getcwd(path, sizeof(path)) ? path : "none";
 }
 
+/// "done", or why not.
+std::string outcome(bool done) { return done ? "done" : std::strerror(errno); }
+
+std::string connected(int family, const sockaddr *address, socklen_t length) {
+  const int socket = ::socket(family, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  const std::string text = outcome(::connect(socket, address, length) == 0);
+  ::close(socket);
+  return text;
+}
+
+std::string opened(const std::string &path, int flags) {
+  const int fd = ::open(path.c_str(), flags | O_CLOEXEC, 0600);
+  const std::string text = outcome(fd >= 0);
+  ::close(fd);
+  return text;
+}
+
+std::string namesIn(const std::string &path) {
+  DIR *directory = ::opendir(path.c_str());
+  if (!directory) return std::strerror(errno);
+  std::vector<std::string> names;
+  while (const dirent *entry = ::readdir(directory)) {
+    if (entry->d_name[0] != '.') names.emplace_back(entry->d_name);
+  }
+  ::closedir(directory);
+  return joined(std::move(names));
+}
+
+std::string linksIn(const std::string &path, const std::string &names) {
+  std::string text;
+  for (std::size_t start = 0; start < names.size();) {
+    const std::size_t end = names.find('\n', start);
+    char target[4096];
+    const ssize_t size = ::readlink((path + "/" + names.substr(start, end - start)).c_str(), target, sizeof(target));
+    text += std::string(target, size < 0 ? 0 : static_cast<std::size_t>(size)) + "\n";
+    start = end + 1;
+  }
+  return text;
+}
+
+/// The lines of /proc/self/status that bear on what the process may do.
+std::string privilegesText() {
+  std::vector<std::string> lines;
+  FILE *status = std::fopen("/proc/self/status", "re");
+  char line[4096];
+  while (std::fgets(line, sizeof(line), status)) {
+    if (std::strncmp(line, "Cap", 3) == 0 || std::strncmp(line, "NoNewPrivs", 10) == 0) {
+      lines.emplace_back(line, std::strcspn(line, "\n"));
+    }
+  }
+  std::fclose(status);
+  return joined(std::move(lines));
+}
+
+/// Tries something on a path, or a port of the loopback address, and says what came of it.
+std::string tried(const std::string &verb, const std::string &path) {
+  if (verb == "read") return opened(path, O_RDONLY);
+  if (verb == "write") return opened(path, O_WRONLY | O_CREAT);
+  if (verb == "list") return namesIn(path);
+  if (verb == "link") return outcome(::symlink("/etc", path.c_str()) == 0);
+  if (verb == "connect") {
+    sockaddr_un address{AF_UNIX, {}};
+    path.copy(address.sun_path, sizeof(address.sun_path) - 1);
+    return connected(AF_UNIX, reinterpret_cast<const sockaddr *>(&address), sizeof(address));
+  }
+  if (verb == "dial") {
+    sockaddr_in address{};
+    address.sin_family = AF_INET;
+    address.sin_port = htons(static_cast<std::uint16_t>(std::atoi(path.c_str() + 1)));
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    return connected(AF_INET, reinterpret_cast<const sockaddr *>(&address), sizeof(address));
+  }
+  return "unknown";
+}
+
 int replyWith(sd_bus_message *message, const std::string &text) {
   return sd_bus_reply_method_return(message, "a(sxa{sv})as", 0, 1, text.c_str());
 }
@@ -76,6 +155,22 @@ int identifierForItem(sd_bus_message *message, void *, sd_bus_error *) {
     return -EINVAL;
   const std::string_view what = std::strrchr(url, '/') + 1;
   if (what == "pid") return replyWith(message, std::to_string(::getpid()));
+  // A path's slashes are written as "=".
+  if (const std::size_t verbEnd = what.find('='); verbEnd != std::string_view::npos) {
+    std::string path(what.substr(verbEnd));
+    std::replace(path.begin(), path.end(), '=', '/');
+    return replyWith(message, tried(std::string(what.substr(0, verbEnd)), path));
+  }
+  if (what == "privileges") return replyWith(message, privilegesText());
+  if (what == "namespaces") return replyWith(message, linksIn("/proc/self/ns", namesIn("/proc/self/ns")));
+  if (what == "leave-a-child") {
+    // It holds on to nothing but its life.
+    if (::fork() == 0) {
+      for (int fd = 0; fd < 100; ++fd) ::close(fd);
+      for (;;) ::pause();
+    }
+    return replyWith(message, "left");
+  }
   if (what == "environment") return replyWith(message, environmentText());
   if (what == "descriptors") return replyWith(message, descriptorsText());
   if (what == "directory") return replyWith(message, directoryText());

@@ -24,7 +24,10 @@ std::vector<std::string> identifiers(const Result<std::vector<ProviderDescriptio
 }
 
 TEST_F(StartUp, NoRequestIsAnsweredBeforeTheRegistryHasCalledBack) {
-  const fs::path gate = session.directory() / "gate";
+  // Where a confined extension sees it.
+  const fs::path container = session.storage("org.sample.slow").parent_path();
+  fs::create_directories(container);
+  const fs::path gate = container / "gate";
   ASSERT_EQ(0, ::mkfifo(gate.c_str(), 0600));
   session.installProvider("org.sample.slow", "setup hold " + gate.string());
   start();
