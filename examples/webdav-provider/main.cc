@@ -1,0 +1,3 @@
+#include "examples/webdav-provider/WebDavProvider.h"
+
+int main() { return storix::runProviderExtension<storix::example::WebDavProvider>(); }
