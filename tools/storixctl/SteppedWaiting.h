@@ -18,7 +18,7 @@ class SteppedWaiting : public Waiting {
   Woken wait(int descriptor, short events, std::optional<Clock::time_point> until) override {
     std::array<pollfd, 2> waited{{{descriptor, events, 0}, {interrupted_.get(), POLLIN, 0}}};
     // A moment for the others whose answer is waited for; how long it takes changes nothing.
-    const int count = ::poll(waited.data(), waited.size(), until ? 1 : 60'000);
+    const int count = ::poll(waited.data(), waited.size(), until && !still_ ? 1 : 60'000);
     if (isInterrupted()) return Woken::interrupted;
     if (count != 0) return Woken::ready;
     if (until) now_ = *until;
@@ -31,6 +31,8 @@ class SteppedWaiting : public Waiting {
   }
   [[nodiscard]] int signalNumber() const override { return SIGINT; }
 
+  /// From now on no time goes by while somebody waits.
+  void standStill() { still_ = true; }
   /// From now on so much time goes by whenever somebody looks.
   void setStep(Clock::duration step) { step_ = step; }
   void advance(Clock::duration time) { now_ += time; }
@@ -40,6 +42,7 @@ class SteppedWaiting : public Waiting {
  private:
   Clock::time_point now_{};
   Clock::duration step_{};
+  bool still_ = false;
   UniqueFd interrupted_{::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)};
 };
 

@@ -58,6 +58,7 @@ class Transfer {
     }
     const auto url = documentURL(invocation_.operands[0], surroundings_.currentDirectory);
     if (!url) return url.error();
+    if (auto failed = wake()) return *std::move(failed);
     const auto claim = claimForReading(url.value());
     if (!claim) return claim.error();
     const auto opened = openPath(url.value().path());
@@ -90,6 +91,7 @@ class Transfer {
     const auto size = takeIn(replacement.value().descriptor());
     if (!size) return size.error();
 
+    if (auto failed = wake()) return *std::move(failed);
     auto claim = claimForWriting(url.value());
     if (!claim) return claim.error();
     if (!claim.value().isHeld()) return claimLost("nothing was written");
@@ -117,10 +119,23 @@ class Transfer {
     return posixError(EACCES, "opening " + document.url.absoluteString() + ": the daemon issued no token for it");
   }
 
+  static Result<bool> resultOf(const std::optional<SXError> &error) {
+    return error ? Result<bool>(*error) : Result<bool>(true);
+  }
+
   /// Waits for an answer, interruptibly, and shows that it does.
   template <class T>
   Result<T> answer(const std::function<void(std::function<void(Result<T>)>)> &start) {
     return await<T>(surroundings_.waiting, start, [this] { line_.show("waiting", std::nullopt, std::nullopt); });
+  }
+
+  /// A daemon that has just been started gives claims before it knows its providers, but answers this
+  /// only when it does.
+  std::optional<SXError> wake() {
+    const auto woken = answer<bool>([this](const std::function<void(Result<bool>)> &handler) {
+      client_.wakeUp([handler](const Client::Outcome &error) { handler(resultOf(error)); });
+    });
+    return woken ? std::nullopt : std::optional(woken.error());
   }
 
   Result<GrantedDocument> resolve() {
@@ -190,10 +205,7 @@ class Transfer {
   /// Has the provider told of the change.
   std::optional<SXError> endWriting(FileClaim claim) {
     const auto ended = answer<bool>([this, &claim](const std::function<void(Result<bool>)> &handler) {
-      ending_ = std::jthread([handler, claim = std::move(claim)]() mutable {
-        const auto error = claim.end();
-        handler(error ? Result<bool>(*error) : Result<bool>(true));
-      });
+      ending_ = std::jthread([handler, claim = std::move(claim)]() mutable { handler(resultOf(claim.end())); });
     });
     if (ended || isClientError(ended.error(), ClientErrorCode::cancelled)) return std::nullopt;
     return withAdvice(ended.error(), "The document is written, but its provider may not have heard of it.");

@@ -47,6 +47,7 @@ class TransfersTest : public CommandsTest {
       answer.emplace_back(std::move(file));
       reply.send(std::move(answer));
     };
+    scripted()->onWakeUp = [](const CompletionHandler<> &reply) { reply(); };
     scripted()->onDocumentURL = [this](const std::string &, const SXDaemon::DocumentReply &reply) {
       reply(URL::fileURLWithPath(path("a")), Data{path("a")}, std::nullopt, std::nullopt, std::nullopt);
     };
@@ -150,6 +151,21 @@ TEST_F(TransfersTest, ReadClaimsTheDocumentAndPrintsIt) {
   EXPECT_EQ(contentOf({"read", urlOf("a")}), "provided");
   EXPECT_THAT(events(), testing::Contains("read " + urlOf("a")).Times(2));
   EXPECT_THAT(complaint(), IsEmpty());
+}
+
+TEST_F(TransfersTest, AClaimIsAskedForOnceTheDaemonKnowsItsProviders) {
+  scripted()->onWakeUp = [this](const CompletionHandler<> &reply) {
+    note("awake");
+    reply();
+  };
+  directory_.write("a", "old");
+  EXPECT_EQ(contentOf({"read", "a"}), "old");
+  EXPECT_EQ(writeFrom("new", {"write", "a"}), done);
+  const auto seen = events();
+  EXPECT_EQ(seen.at(0), "awake");
+  EXPECT_EQ(seen.at(1), "read " + urlOf("a"));
+  EXPECT_EQ(seen.at(seen.size() - 3), "awake");
+  EXPECT_EQ(seen.at(seen.size() - 2), "write " + urlOf("a"));
 }
 
 TEST_F(TransfersTest, CatResolvesClaimsAndOpensWithTheToken) {
@@ -346,6 +362,7 @@ TEST_F(TransfersTest, WaitingForTheProviderIsShownOnATerminal) {
 
 TEST_F(TransfersTest, NothingIsShownOfWhatIsQuick) {
   Terminal terminal;
+  waiting_.standStill();
   surroundings_.terminal = terminal.descriptor();
   directory_.write("a", "here");
   EXPECT_EQ(contentOf({"read", "a"}), "here");
