@@ -78,8 +78,8 @@ bool checkSetup(CheckedExtension &extension, const std::optional<std::string> &s
     if (!answer) continue;
     answered = true;
     if (const auto failure = failureOf(*answer)) {
-      extension.findings().error("PerformInitialSetup: " + *failure +
-                                 " Without it the daemon leaves the provider out.");
+      extension.findings().error("PerformInitialSetup: the daemon leaves out a provider that answers an error: " +
+                                 *failure);
     }
   }
   if (!storage || !answered) return false;

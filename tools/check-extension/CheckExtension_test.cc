@@ -233,7 +233,9 @@ TEST_F(CheckExtensionTest, DescriptorsThatLeakAreCounted) {
 // --- The operations
 
 TEST_F(CheckExtensionTest, ASetupThatFailsIsNamed) {
-  EXPECT_THAT(findingsWith("fails its setup"), Contains(HasSubstr("PerformInitialSetup: The account is locked.")));
+  EXPECT_THAT(findingsWith("fails its setup"),
+              Contains("error: PerformInitialSetup: the daemon leaves out a provider that answers an error: The "
+                       "account is locked."));
 }
 
 TEST_F(CheckExtensionTest, ASetupThatMakesNoDirectoryIsNamed) {
