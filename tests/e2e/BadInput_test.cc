@@ -6,6 +6,7 @@
 
 #include <cstring>
 
+#include "tests/e2e/BareClient.h"
 #include "tests/e2e/E2ETest.h"
 #include "wire/UniqueFd.h"
 
@@ -13,34 +14,6 @@ namespace storix::e2e {
 namespace {
 
 using namespace std::string_literals;
-
-/// A D-Bus client without any of our code.
-class BareClient {
- public:
-  explicit BareClient(const std::string &socket) {
-    EXPECT_GE(sd_bus_new(&bus_), 0);
-    EXPECT_GE(sd_bus_set_address(bus_, ("unix:path=" + socket).c_str()), 0);
-    EXPECT_GE(sd_bus_start(bus_), 0);
-  }
-  ~BareClient() { sd_bus_flush_close_unref(bus_); }
-  BareClient(const BareClient &) = delete;
-  BareClient &operator=(const BareClient &) = delete;
-
-  /// Calls a method of the service with those arguments; the name of the D-Bus error, or "" for an
-  /// answer.
-  template <class... Arguments>
-  std::string call(const char *method, const char *signature, Arguments... arguments) {
-    sd_bus_error error{};
-    const int result = sd_bus_call_method(bus_, nullptr, "/com/tessel/Storix", "com.tessel.Storix.Daemon", method,
-                                          &error, nullptr, signature, arguments...);
-    std::string name = result < 0 ? (error.name ? error.name : std::strerror(-result)) : "";
-    sd_bus_error_free(&error);
-    return name;
-  }
-
- private:
-  sd_bus *bus_ = nullptr;
-};
 
 UniqueFd connectTo(const std::string &path) {
   UniqueFd socket(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
@@ -61,6 +34,44 @@ bool isClosed(const UniqueFd &socket) {
     const ssize_t count = ::recv(socket.get(), buffer, sizeof buffer, 0);
     if (count <= 0) return count == 0 || errno == ECONNRESET;
   }
+}
+
+/// The bytes of a call of the daemon with one text, which an ordinary client would refuse to send.
+std::string callWithOneText(const std::string &member, const std::string &text) {
+  const auto length = [](std::size_t size) {
+    return std::string{static_cast<char>(size), static_cast<char>(size >> 8), 0, 0};
+  };
+  std::string fields;
+  const auto field = [&fields, &length](char code, char type, const std::string &value) {
+    fields.resize((fields.size() + 7) / 8 * 8);
+    fields += {code, 1, type, 0};
+    fields += type == 'g' ? std::string(1, static_cast<char>(value.size())) : length(value.size());
+    fields += value + '\0';
+  };
+  field(1, 'o', "/com/tessel/Storix");
+  field(2, 's', "com.tessel.Storix.Daemon");
+  field(3, 's', member);
+  field(8, 'g', "as");
+  const std::string string = length(text.size()) + text + '\0';
+  const std::string body = length(string.size()) + string;
+  std::string bytes = std::string{'l', 1, 0, 1} + length(body.size()) + length(1) + length(fields.size()) + fields;
+  bytes.resize((bytes.size() + 7) / 8 * 8);
+  return bytes + body;
+}
+
+/// Whether the text is in what the daemon sends, before it closes the connection.
+bool receivesText(const UniqueFd &socket, const std::string &text) {
+  timeval patience{};
+  patience.tv_sec = deadline.count();
+  ::setsockopt(socket.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+  std::string received;
+  while (received.find(text) == std::string::npos) {
+    char buffer[1024];
+    const ssize_t count = ::recv(socket.get(), buffer, sizeof buffer, 0);
+    if (count <= 0) return false;
+    received.append(buffer, static_cast<std::size_t>(count));
+  }
+  return true;
 }
 
 constexpr const char *invalidArguments = SD_BUS_ERROR_INVALID_ARGS;
@@ -130,6 +141,45 @@ TEST_F(BadInput, TextsPastTheLimitAreRefusedAndThoseAtItAreTaken) {
   EXPECT_EQ("", client.call("BookmarkableStringFromDocumentURL", "as", 1, longest.c_str()));
   EXPECT_EQ(limitsExceeded, client.call("BookmarkableStringFromDocumentURL", "as", 1, (longest + "a").c_str()));
   EXPECT_EQ(limitsExceeded, client.call("DocumentURLFromBookmarkableString", "as", 1, std::string(65537, '/').c_str()));
+  expectOthersUnaffected();
+}
+
+TEST_F(BadInput, TextThatIsNotUTF8IsRefusedAndNobodyElseNotices) {
+  startWithBystander();
+  const UniqueFd well = connectTo(session.serviceSocket().string());
+  const std::string login = "\0AUTH EXTERNAL\r\nDATA\r\nBEGIN\r\n"s;
+  const std::string understood = login + callWithOneText("DocumentURLFromBookmarkableString", "caf\xc3\xa9");
+  ASSERT_EQ(static_cast<ssize_t>(understood.size()),
+            ::send(well.get(), understood.data(), understood.size(), MSG_NOSIGNAL));
+  EXPECT_TRUE(receivesText(well, "com.tessel.storix")) << "the domain of the answer's error";
+  for (const char *member : {"DocumentURLFromBookmarkableString", "BookmarkableStringFromDocumentURL"}) {
+    const UniqueFd socket = connectTo(session.serviceSocket().string());
+    const std::string bytes = login + callWithOneText(member, "file:///storix:org.sample.docs/\xc3\x28\xff");
+    ASSERT_EQ(static_cast<ssize_t>(bytes.size()), ::send(socket.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL));
+    EXPECT_TRUE(receivesText(socket, invalidArguments)) << member;
+    expectOthersUnaffected();
+  }
+}
+
+TEST_F(BadInput, BookmarkableStringThatIsNoneIsRefused) {
+  startWithBystander();
+  const std::unique_ptr<Client> client = makeClient();
+  for (const std::string &string :
+       {""s, "storix:"s, "Storix:org.sample.docs/a"s, "STORIX:org.sample.docs/a"s, "  storix:org.sample.docs/a"s,
+        "storix://a"s, "storix:/a"s, "storix:org.sample.docs"s, "storix:org.sample.docs/"s,
+        "storix:org.sample.docs//a"s, std::string(65536, '/')}) {
+    const auto resolved = client->resolveBookmark(string);
+    ASSERT_FALSE(resolved) << string;
+    EXPECT_EQ(storixErrorDomain, resolved.error().domain()) << resolved.error().message();
+    EXPECT_EQ(static_cast<std::int64_t>(SXErrorCode::invalidBookmarkableString), resolved.error().code());
+  }
+  // Well-formed, a "/" at the end included: it is the grant that is missing.
+  for (const char *string :
+       {"storix:org.sample.docs/a/", "storix:org.sample.docs/a//b", "storix:org.sample.docs/a/b"}) {
+    const auto resolved = client->resolveBookmark(string);
+    ASSERT_FALSE(resolved) << string;
+    EXPECT_EQ(static_cast<std::int64_t>(SXErrorCode::notPermitted), resolved.error().code());
+  }
   expectOthersUnaffected();
 }
 

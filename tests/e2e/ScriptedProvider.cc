@@ -4,15 +4,18 @@
 //
 // OPERATION is setup, identifier, url, placeholder, start, stop or changed. ACTION is one of
 //   fail TEXT     answer an error with that text
-//   hold FIFO     say "holding OPERATION" on stderr, wait until somebody writes to the FIFO, go on
+//   hold FIFO     say "holding OPERATION" on stderr, wait until somebody writes to the FIFO, go on;
+//                 it must lie in the group container, where the provider sees it
 //   exit STATUS   end the process at once
 //   never         never answer
+//   claim PATH    claim that file of its own for reading and then for writing, say "claimed", go on
 // An operation without a line does its work: the item's identifier is its path below the storage, and
 // starting to provide it writes "contents of IDENTIFIER" there. On stderr the process says "process PID"
 // when it starts, and every call "called OPERATION".
 
 #include <unistd.h>
 
+#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
@@ -21,6 +24,7 @@
 #include <sstream>
 #include <vector>
 
+#include "storix/FileCoordinator.h"
 #include "storix/ProviderExtension.h"
 
 namespace {
@@ -111,8 +115,25 @@ class ScriptedProvider : public storix::ProviderExtension {
         std::ifstream fifo(step.argument);
         fifo.get();
       }
+      if (step.action == "claim") claim(step.argument);
     }
     return true;
+  }
+
+  /// As any other process would; the text says what came of it.
+  static void claim(const std::string &path) {
+    const storix::ClaimOptions patience{.deadline = std::chrono::seconds(30)};
+    storix::FileCoordinator coordinator;
+    const URL url = *URL::fileURLWithPath(path);
+    for (const bool writing : {false, true}) {
+      auto claim = writing ? coordinator.write(url, patience) : coordinator.read(url, patience);
+      const auto error = claim ? claim.value().end() : std::optional(claim.error());
+      if (error) {
+        std::fprintf(stderr, "not claimed: %s\n", error->message().c_str());
+        return;
+      }
+    }
+    std::fprintf(stderr, "claimed\n");
   }
 
   static void write(const std::string &path, const std::string &content) {
