@@ -12,6 +12,7 @@
 
 #include <array>
 #include <csignal>
+#include <cstddef>
 #include <cstring>
 #include <functional>
 #include <string>
@@ -32,6 +33,10 @@ class TestListener {
     EXPECT_EQ(::listen(socket_.get(), 16), 0);
   }
 
+  /// Without the zero byte that makes it an abstract one.
+  [[nodiscard]] std::string name() const {
+    return {address_.sun_path + 1, length_ - offsetof(sockaddr_un, sun_path) - 1};
+  }
   [[nodiscard]] UniqueFd connectToIt() const {
     UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
     if (::connect(fd.get(), reinterpret_cast<const sockaddr *>(&address_), length_) != 0) fd.reset();
