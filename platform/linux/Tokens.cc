@@ -35,6 +35,8 @@ std::string encoded(const unsigned char *bytes, std::size_t count) {
   return text;
 }
 
+/// None for every text but the one that `encoded` makes: the library takes some bytes beyond ASCII for
+/// letters of its alphabet.
 std::optional<std::string> decoded(std::string_view text) {
   std::string bytes(text.size(), '\0');
   std::size_t count = 0;
@@ -43,6 +45,7 @@ std::optional<std::string> decoded(std::string_view text) {
     return std::nullopt;
   }
   bytes.resize(count);
+  if (encoded(bytesOf(bytes), bytes.size()) != text) return std::nullopt;
   return bytes;
 }
 

@@ -55,6 +55,21 @@ TEST(Tokens, EveryChangedByteIsSeen) {
   }
 }
 
+TEST(Tokens, BytesThatADecoderTakesForLettersAreRefused) {
+  const TestDirectory directory;
+  const TokenSealer sealer = sealerIn(directory);
+  std::string token = sealer.seal(sample());
+  // There are such bytes for "_" alone, so there must be one after the last dot.
+  while (token.rfind('_') == std::string::npos || token.rfind('_') < token.rfind('.')) token = sealer.seal(sample());
+  for (std::size_t i = 0; i < token.size(); ++i) {
+    for (int other = 128; other < 256; ++other) {
+      std::string forged = token;
+      forged[i] = static_cast<char>(other);
+      EXPECT_EQ(sealer.unseal(forged), std::nullopt) << i << " " << other;
+    }
+  }
+}
+
 TEST(Tokens, CutOrExtendedTokenIsRefused) {
   const TestDirectory directory;
   const TokenSealer sealer = sealerIn(directory);
