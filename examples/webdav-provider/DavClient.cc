@@ -65,6 +65,7 @@ class DownloadSink {
       partial_.length += count;
       bytes.remove_prefix(static_cast<std::size_t>(count));
     }
+    if (partial_.grown) partial_.grown(partial_.length);
     return std::nullopt;
   }
 

@@ -3,6 +3,7 @@
 #include <chrono>
 #include <cstdint>
 #include <ctime>
+#include <functional>
 #include <optional>
 #include <stop_token>
 #include <string>
@@ -24,6 +25,8 @@ struct DavSettings {
   /// second time; the wait doubles.
   int attempts = 5;
   std::chrono::milliseconds retryDelay{500};
+  /// How often it is told how far a download is.
+  std::chrono::milliseconds progressInterval{500};
 };
 
 /// A download that has begun, in a file that nobody else uses. What is there of it is good: after a
@@ -33,6 +36,8 @@ struct PartialDownload {
   /// Of the version whose first bytes are there; empty where there are none.
   std::string etag;
   std::int64_t length = 0;
+  /// Hears of the length as it grows; may be empty.
+  std::function<void(std::int64_t)> grown;
 };
 
 struct Downloaded {

@@ -7,6 +7,7 @@
 #include <utility>
 
 #include "examples/webdav-provider/ContentHash.h"
+#include "examples/webdav-provider/Placeholders.h"
 
 namespace storix::example {
 
@@ -58,11 +59,12 @@ DocumentSync::Outcome DocumentSync::provide(const std::string &path) {
   if (!remote) return {remote.error(), {}};
   if (!remote.value()) return {posixError(ENOENT, "looking for \"" + path + "\" on the server"), {}};
   if (remote.value()->isCollection) return {posixError(EISDIR, "downloading \"" + path + "\""), {}};
-  return fetch(path, std::nullopt);
+  return fetch(path, std::nullopt, remote.value());
 }
 
-DocumentSync::Outcome DocumentSync::fetch(const std::string &path, const std::optional<ItemState> &clean) {
-  auto fetched = download(path, clean ? clean->etag : "");
+DocumentSync::Outcome DocumentSync::fetch(const std::string &path, const std::optional<ItemState> &clean,
+                                          const std::optional<DavEntry> &announced) {
+  auto fetched = download(path, clean ? clean->etag : "", announced);
   if (!fetched) return {fetched.error(), {}};
   if (fetched.value().download.isUnchanged) return {};
   auto replacing = LocalCopies::Replacing::no;
@@ -190,11 +192,17 @@ bool DocumentSync::mayHaveChanges(const std::string &path) const {
   return !state || state->stamp != local.value()->stamp;
 }
 
-Result<DocumentSync::Fetched> DocumentSync::download(const std::string &path, const std::string &knownETag) {
+Result<DocumentSync::Fetched> DocumentSync::download(const std::string &path, const std::string &knownETag,
+                                                     const std::optional<DavEntry> &announced) {
   ItemState state = states_.read(path).value_or(ItemState{});
   auto file = copies_.openPartial(path, state.partialLength);
   if (!file) return file.error();
-  PartialDownload partial{file.value().get(), state.partialETag, state.partialLength};
+  std::optional<ProgressInPlaceholder> progress;
+  PartialDownload partial{file.value().get(), state.partialETag, state.partialLength, {}};
+  if (announced) {
+    progress.emplace(copies_, path, *announced, client_.settings().progressInterval);
+    partial.grown = [&progress](std::int64_t length) { progress->arrived(length); };
+  }
   if (::lseek(partial.file, 0, SEEK_END) != partial.length) {
     partial.length = 0;
     partial.etag.clear();

@@ -52,10 +52,13 @@ class DocumentSync {
   };
 
   Outcome uploadOnce(const std::string &path, bool &again);
-  Outcome fetch(const std::string &path, const std::optional<ItemState> &clean);
+  Outcome fetch(const std::string &path, const std::optional<ItemState> &clean,
+                const std::optional<DavEntry> &announced = std::nullopt);
   Outcome settleConflict(const std::string &path, const std::string &localHash, const FileStamp &localStamp);
-  /// Into the hidden file; absent file: unchanged. What there is after a failure is remembered.
-  Result<Fetched> download(const std::string &path, const std::string &knownETag);
+  /// Into the hidden file; absent file: unchanged. What there is after a failure is remembered. The
+  /// progress is told in the placeholder of what the server has announced.
+  Result<Fetched> download(const std::string &path, const std::string &knownETag,
+                           const std::optional<DavEntry> &announced = std::nullopt);
   std::optional<SXError> remember(const std::string &path, const Fetched &fetched, const FileStamp &stamp) const;
 
   DavClient &client_;

@@ -308,12 +308,48 @@ TEST_F(Downloads, PlaceholdersTellWhatTheServerTells) {
   EXPECT_EQ(placeholder("missing").error().code(), ENOENT);
 }
 
+TEST_F(Downloads, ThePlaceholderTellsHowFarADownloadIs) {
+  progressInterval_ = std::chrono::milliseconds(0);
+  server_.write("film", longContent());
+  cutNextDownload(100'000);
+  std::string during;
+  proxy_.next({"GET", [&] { during = local(".film"); }, {}, {}, {}});
+  ASSERT_EQ(start("film"), succeeded);
+  EXPECT_THAT(during, HasSubstr("\"received\":"));
+  EXPECT_THAT(during, HasSubstr("\"size\":" + std::to_string(longContent().size())));
+  EXPECT_THAT(local(".film"), HasSubstr("\"size\":"));
+  EXPECT_THAT(local(".film"), Not(HasSubstr("received")));
+}
+
+TEST_F(Downloads, AnApplicationsCompanionIsNotOverwritten) {
+  progressInterval_ = std::chrono::milliseconds(0);
+  server_.write("film", longContent());
+  for (const std::string companion : {"an application's own", "{}", R"({"size": 1})", ""}) {
+    change(".film", companion);
+    EXPECT_EQ(placeholder("film").error().code(), EEXIST);
+    EXPECT_EQ(local(".film"), companion);
+  }
+  ASSERT_EQ(start("film"), succeeded);
+  EXPECT_EQ(local(".film"), "");
+  fs::remove(localPath(".film"));
+  fs::create_symlink("elsewhere", localPath(".film"));
+  EXPECT_EQ(placeholder("film").error().code(), EEXIST);
+  EXPECT_TRUE(fs::is_symlink(localPath(".film")));
+  fs::remove(localPath(".film"));
+  ASSERT_TRUE(placeholder("film").ok());
+  EXPECT_TRUE(placeholder("film").ok()) << "a placeholder may be replaced";
+}
+
 TEST_F(Downloads, AFoldersPlaceholderIsWhatIsInIt) {
   server_.write("reports/a.txt", "x");
   server_.write("reports/deep/b.txt", "x");
   server_.write("reports/.hidden", "x");
+  server_.write("reports/taken.txt", "x");
+  fs::create_directory(localPath("reports"));
+  change("reports/.taken.txt", "an application's own");
   const auto made = placeholder("reports");
   ASSERT_TRUE(made.ok()) << made.error().message();
+  EXPECT_EQ(local("reports/.taken.txt"), "an application's own");
   EXPECT_TRUE(isHere("reports/.a.txt"));
   EXPECT_FALSE(isHere("reports/a.txt"));
   EXPECT_TRUE(fs::is_directory(localPath("reports/deep")));
@@ -361,7 +397,7 @@ TEST_F(Downloads, BreakingOffEndsAWaitAtOnce) {
   std::optional<SXError> failed;
   std::thread reader([&] {
     UniqueFd file(::open(folder_.path("partial").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
-    PartialDownload partial{file.get(), "", 0};
+    PartialDownload partial{file.get(), "", 0, {}};
     const auto downloaded = client.download("film", "", partial, ending.get_token());
     if (!downloaded) failed = downloaded.error();
   });

@@ -11,11 +11,14 @@
 #include <filesystem>
 #include <utility>
 
+#include "examples/webdav-provider/KeyedValues.h"
+
 namespace storix::example {
 
 namespace {
 
 constexpr int conflictNamesAtMost = 1000;
+constexpr std::size_t companionAtMost = 64 * 1024;
 
 std::string lastComponent(const std::string &path) { return path.substr(path.rfind('/') + 1); }
 
@@ -109,6 +112,22 @@ std::optional<SXError> LocalCopies::makeDirectory(const std::string &path) const
   if (auto refused = FolderTree::checkPath(path)) return refused;
   auto made = tree_.openParentMakingIt(path + "/x");
   return made ? std::nullopt : std::optional(made.error());
+}
+
+Result<std::optional<std::string>> LocalCopies::readCompanion(const std::string &path) const {
+  if (auto refused = FolderTree::checkPath(path)) return *refused;
+  const auto parent = tree_.openParentMakingIt(path);
+  if (!parent) return parent.error();
+  const std::string name = "." + lastComponent(path);
+  const UniqueFd file(::openat(parent.value().get(), name.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+  if (!file && errno == ENOENT) return std::optional<std::string>();
+  struct stat status {};
+  if (!file || ::fstat(file.get(), &status) != 0 || !S_ISREG(status.st_mode)) {
+    return posixError(EEXIST, "reading the companion of \"" + path + "\"");
+  }
+  auto text = readWhole(file.get(), companionAtMost);
+  if (!text) return posixError(EEXIST, "reading the companion of \"" + path + "\"");
+  return std::optional(std::move(text.value()));
 }
 
 std::vector<std::string> LocalCopies::items() const {

@@ -43,6 +43,9 @@ class LocalCopies {
   std::optional<SXError> remove(const std::string &path) const { return tree_.remove(path); }
   /// Makes the directory of a collection.
   std::optional<SXError> makeDirectory(const std::string &path) const;
+  /// What is in the place of the item's companion; absent when nothing is. EEXIST for what is no text of
+  /// ordinary length in an ordinary file.
+  Result<std::optional<std::string>> readCompanion(const std::string &path) const;
   Result<std::string> putCompanion(const std::string &path, std::string_view text) const {
     return tree_.putCompanion(path, text);
   }

@@ -1,14 +1,12 @@
 #include "examples/webdav-provider/WebDavProvider.h"
 
-#include <rapidjson/stringbuffer.h>
-#include <rapidjson/writer.h>
-
 #include <cerrno>
 #include <cstdio>
 #include <utility>
 
 #include "examples/webdav-provider/Configuration.h"
 #include "examples/webdav-provider/DavPath.h"
+#include "examples/webdav-provider/Placeholders.h"
 
 namespace storix::example {
 
@@ -21,29 +19,6 @@ std::string joined(const std::string &directory, const std::string &name) {
 }
 
 }  // namespace
-
-std::optional<std::string> placeholderText(const std::string &name, const DavEntry &entry) {
-  if (!isUTF8(name)) return std::nullopt;
-  rapidjson::StringBuffer buffer;
-  rapidjson::Writer<rapidjson::StringBuffer> writer(buffer);
-  const auto string = [&writer](const char *key, const std::string &value) {
-    writer.Key(key);
-    writer.String(value.data(), static_cast<rapidjson::SizeType>(value.size()));
-  };
-  writer.StartObject();
-  if (!entry.etag.empty()) string("etag", entry.etag);
-  if (entry.modificationTime) {
-    writer.Key("modificationTime");
-    writer.Int64(*entry.modificationTime);
-  }
-  string("name", name);
-  if (entry.size) {
-    writer.Key("size");
-    writer.Int64(*entry.size);
-  }
-  writer.EndObject();
-  return std::string(buffer.GetString(), buffer.GetSize()) + "\n";
-}
 
 WebDavProvider::WebDavProvider(ProviderEnvironment environment)
     : WebDavProvider(std::move(environment), &readConfiguration) {}
@@ -202,16 +177,9 @@ Result<URL> WebDavProvider::writePlaceholders(const std::string &path) {
     if (auto failed = writePlaceholdersIn(*place.value(), path)) return *failed;
     return providedItemsURL()->appendingPathComponent(path, true);
   }
-  const auto companion = writePlaceholder(*place.value(), path, *entry.value());
+  const auto companion = writePlaceholder(place.value()->copies, path, *entry.value());
   if (!companion) return companion.error();
   return providedItemsURL()->appendingPathComponent(companion.value());
-}
-
-Result<std::string> WebDavProvider::writePlaceholder(const Workplace &place, const std::string &path,
-                                                     const DavEntry &entry) {
-  const auto text = placeholderText(path.substr(path.rfind('/') + 1), entry);
-  if (!text) return posixError(EILSEQ, "writing the placeholder of \"" + path + "\"");
-  return place.copies.putCompanion(path, *text);
 }
 
 std::optional<SXError> WebDavProvider::writePlaceholdersIn(Workplace &place, const std::string &path) {
@@ -223,7 +191,8 @@ std::optional<SXError> WebDavProvider::writePlaceholdersIn(Workplace &place, con
     if (entry.path.find('/') != std::string::npos || FolderTree::checkPath(item) || !isUTF8(item)) continue;
     if (entry.isCollection) {
       if (auto failed = place.copies.makeDirectory(item)) return failed;
-    } else if (const auto written = writePlaceholder(place, item, entry); !written) {
+    } else if (const auto written = writePlaceholder(place.copies, item, entry);
+               !written && written.error().code() != EEXIST) {
       return written.error();
     }
   }

@@ -38,8 +38,7 @@ class WebDavProvider : public ProviderExtension {
   /// makes placeholders for what is in the folder.
   void performInitialSetup(Completion completion) override;
 
-  /// A keyed-value file with "etag", "modificationTime" (seconds since 1970), "name" and "size", each
-  /// where the server says it. For a folder: its directory, with the placeholders of what is in it.
+  /// For a folder: its directory, with the placeholders of what is in it.
   void providePlaceholder(const URL &url, URLCompletion completion) override;
   void startProviding(const URL &url, Completion completion) override;
   void itemChanged(const URL &url, Completion completion) override;
@@ -66,7 +65,6 @@ class WebDavProvider : public ProviderExtension {
   std::optional<SXError> work(const std::string &path,
                               DocumentSync::Outcome (DocumentSync::*step)(const std::string &));
   Result<URL> writePlaceholders(const std::string &path);
-  static Result<std::string> writePlaceholder(const Workplace &place, const std::string &path, const DavEntry &entry);
   std::optional<SXError> writePlaceholdersIn(Workplace &place, const std::string &path);
   void catchUp();
 
@@ -80,8 +78,5 @@ class WebDavProvider : public ProviderExtension {
   std::thread catchingUp_;                ///< Under the mutex.
   std::atomic<bool> isCatchingUp_{false};
 };
-
-/// The text of an item's placeholder; none where its name is not UTF-8.
-std::optional<std::string> placeholderText(const std::string &name, const DavEntry &entry);
 
 }  // namespace storix::example

@@ -33,6 +33,7 @@ class WebDavProviderTest : public ::testing::Test {
               settings.value().attempts = attempts_;
               settings.value().retryDelay = std::chrono::milliseconds(1);
               settings.value().http.stallTimeout = stallTimeout_;
+              settings.value().progressInterval = progressInterval_;
             }
             return settings;
           });
@@ -99,6 +100,7 @@ class WebDavProviderTest : public ::testing::Test {
   FaultProxy proxy_;
   int attempts_ = 4;
   std::chrono::seconds stallTimeout_{30};
+  std::chrono::milliseconds progressInterval_{500};
   std::unique_ptr<WebDavProvider> provider_;
 };
 
