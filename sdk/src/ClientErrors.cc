@@ -21,11 +21,13 @@ SXError incompleteAnswer(std::string sentence) {
   return clientError(ClientErrorCode::incompleteAnswer, std::move(sentence));
 }
 
+SXError connectionLostError() {
+  return clientError(ClientErrorCode::connectionLost,
+                     "The connection to the document broker ended before the answer came.");
+}
+
 SXError clientErrorOf(const wire::MethodFailure &failure) {
-  if (failure.name == wire::busErrorName::disconnected) {
-    return clientError(ClientErrorCode::connectionLost,
-                       "The connection to the document broker ended before the answer came.");
-  }
+  if (failure.name == wire::busErrorName::disconnected) return connectionLostError();
   return clientError(ClientErrorCode::refused, "The document broker refused the request: " + failure.text,
                      {{"name", failure.name}});
 }

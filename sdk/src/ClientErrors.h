@@ -10,6 +10,7 @@ namespace storix::sdk {
 SXError clientError(ClientErrorCode code, std::string sentence, Dictionary details = {});
 
 SXError incompleteAnswer(std::string sentence);
+SXError connectionLostError();
 
 /// The error of a request that the daemon answered by a D-Bus error, or whose connection ended.
 SXError clientErrorOf(const wire::MethodFailure &failure);

@@ -58,6 +58,8 @@ Result<std::shared_ptr<wire::BusConnection>> connectTo(BusLoop &loop, const std:
   options.peer = name;
   auto added = loop.add(std::move(socket.value()), std::move(options), prepare);
   if (!added) {
+    // The loop ends with whoever wanted to connect.
+    if (added.error().code() == ESHUTDOWN) return connectionLostError();
     return clientError(ClientErrorCode::notReachable,
                        "The connection to the document broker failed: " + added.error().message());
   }
