@@ -190,4 +190,16 @@ Result<HostEnvironment> HostEnvironment::fromVariables(const EnvironmentVariable
   return environment;
 }
 
+ConfinementPlaces HostEnvironment::confinementPlaces() const {
+  ConfinementPlaces places;
+  places.homeDirectory = homeDirectory;
+  places.extensions = extensionPlaces;
+  places.hidden = {runtimeDirectory, homeDirectory + "/Library/Storix", "/proc", "/sys", "/dev", "/run/user",
+                   "/run/dbus"};
+  if (!sessionRuntimeDirectory.empty()) places.hidden.push_back(sessionRuntimeDirectory);
+  places.unwritable = extensionPlaces.extensionDirectories;
+  places.unwritable.insert(places.unwritable.end(), applicationDirectories.begin(), applicationDirectories.end());
+  return places;
+}
+
 }  // namespace storix::linuxhost

@@ -41,6 +41,10 @@ struct HostEnvironment {
   /// of XDG's that is not absolute is ignored. The error says which variable is wrong and what it should
   /// be.
   static Result<HostEnvironment> fromVariables(const EnvironmentVariables &variables);
+
+  /// What matters to the sandboxes of extensions: they see nothing that lets them act as their user, or as
+  /// another extension.
+  [[nodiscard]] ConfinementPlaces confinementPlaces() const;
 };
 
 }  // namespace storix::linuxhost

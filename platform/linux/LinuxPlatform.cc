@@ -21,25 +21,6 @@ std::unique_ptr<LogSink> makeLogSink(const HostEnvironment &environment) {
                                    : makeLineLogSink(environment.logSeverity, STDERR_FILENO);
 }
 
-/// What no extension is to see is what lets it act as its user, or as another extension.
-std::unique_ptr<ExtensionConfinement> makeConfinement(const HostEnvironment &environment) {
-  ConfinementPlaces places;
-  places.homeDirectory = environment.homeDirectory;
-  places.extensions = environment.extensionPlaces;
-  places.hidden = {environment.runtimeDirectory,
-                   environment.homeDirectory + "/Library/Storix",
-                   "/proc",
-                   "/sys",
-                   "/dev",
-                   "/run/user",
-                   "/run/dbus"};
-  if (!environment.sessionRuntimeDirectory.empty()) places.hidden.push_back(environment.sessionRuntimeDirectory);
-  places.unwritable = environment.extensionPlaces.extensionDirectories;
-  places.unwritable.insert(places.unwritable.end(), environment.applicationDirectories.begin(),
-                           environment.applicationDirectories.end());
-  return std::make_unique<ExtensionConfinement>(std::move(places), environment.confinement);
-}
-
 }  // namespace
 
 std::optional<std::string> missingSocketWarning(const ActivatedSockets &activated) {
@@ -83,8 +64,9 @@ LinuxPlatform::LinuxPlatform(HostEnvironment environment, std::unique_ptr<EventL
       notifications_(*eventLoop_),
       peers_(std::move(peers)),
       sandbox_(std::move(sandbox)),
-      extensions_(std::make_unique<ExtensionHost>(environment_.extensionPlaces, environment_.extensionEnvironment,
-                                                  pool_, ioLoop_, makeConfinement(environment_))),
+      extensions_(std::make_unique<ExtensionHost>(
+          environment_.extensionPlaces, environment_.extensionEnvironment, pool_, ioLoop_,
+          std::make_unique<ExtensionConfinement>(environment_.confinementPlaces(), environment_.confinement))),
       fileCoordination_(pool_, [this](const std::string &identifier, pid_t process) {
         return extensions_->isProcessOfExtension(identifier, process);
       }) {}

@@ -42,6 +42,7 @@ TEST_F(ProviderKit, TheTemplateProviderIsFitToShip) {
 }
 
 TEST_F(ProviderKit, TheFolderProviderIsFitToShip) {
+  const std::string source = (session.directory() / "source").string();
   fs::create_directories(session.directory() / "source/reports");
   session.write(session.directory() / "source/reports/may 100%.txt", "Sold out.");
   session.write(session.directory() / "source/large.bin", std::string(8U << 20, 'x'));
@@ -50,8 +51,8 @@ TEST_F(ProviderKit, TheFolderProviderIsFitToShip) {
                             "KTBundleVersion": "1", "KTGroupContainers": ["group.org.sample.docs"],
                             "KTExtensionPointIdentifier": "com.tessel.storix-nonui",
                             "KTExtension": {"KTExtensionStorixDocumentGroup": "group.org.sample.docs"},
-                            "FolderProviderSource": ")" +
-                            (session.directory() / "source").string() + "\"}",
+                            "KTSandbox": {"readWrite": [")" +
+                            source + R"("]}, "FolderProviderSource": ")" + source + "\"}",
                         builtProgram("folder-provider"));
   const Finished checked =
       check("folder.appdex", {"--file", "reports/may 100%.txt", "--item=large.bin", "--file=large.bin"});

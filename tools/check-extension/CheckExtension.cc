@@ -7,6 +7,7 @@
 #include <utility>
 
 #include "platform/linux/ExtensionBundles.h"
+#include "platform/linux/ExtensionConfinement.h"
 #include "platform/linux/HostEnvironment.h"
 #include "tools/check-extension/CheckBadInput.h"
 #include "tools/check-extension/CheckBundle.h"
@@ -41,18 +42,18 @@ class WorkingDirectory {
   std::string path_;
 };
 
-/// What every extension gets of the environment, and a runtime directory without a daemon in it.
-Result<std::vector<std::string>> commonEnvironment(const std::string &runtimeDirectory) {
+/// The session as the daemon would see it, but with directories of the check's own.
+Result<linuxhost::HostEnvironment> hostEnvironment(const std::string &workingDirectory) {
   auto variables = linuxhost::processEnvironment();
-  variables.insert_or_assign("STORIX_RUNTIME_DIR", runtimeDirectory);
+  variables.insert_or_assign("STORIX_RUNTIME_DIR", workingDirectory + "/run");
   auto host = linuxhost::HostEnvironment::fromVariables(variables);
-  if (!host) return host.error();
-  return host.value().extensionEnvironment;
+  if (host) host.value().extensionPlaces.groupContainersDirectory = workingDirectory + "/groups";
+  return host;
 }
 
 /// The container of the bundle's document group: the one that was given, or one of the fresh ones.
 Result<std::optional<std::string>> groupContainer(const ExtensionCheck &check, const linuxhost::ExtensionBundle &bundle,
-                                                  const std::string &workingDirectory) {
+                                                  const linuxhost::ExtensionPlaces &places) {
   const auto group = bundle.documentGroup();
   if (!group) return std::optional<std::string>();
   if (check.container) {
@@ -63,8 +64,6 @@ Result<std::optional<std::string>> groupContainer(const ExtensionCheck &check, c
     }
     return std::optional(given.string());
   }
-  linuxhost::ExtensionPlaces places;
-  places.groupContainersDirectory = workingDirectory + "/groups";
   const auto problems = linuxhost::makeGroupContainers(places, bundle);
   if (!problems.empty()) return problems.front().error;
   return std::optional(groupContainerPath(places, *group));
@@ -91,6 +90,41 @@ bool checkSetup(CheckedExtension &extension, const std::optional<std::string> &s
   return fs::create_directory(*storage, failed);
 }
 
+std::vector<KnownItem> knownItems(const ExtensionCheck &check) {
+  std::vector<KnownItem> items;
+  for (const std::string &identifier : check.items) items.push_back({identifier, ""});
+  for (const std::string &path : check.files) items.push_back({std::nullopt, path});
+  return items;
+}
+
+/// Everything, without a sandbox that would hide what the extension does elsewhere.
+void checkEverything(CheckedExtension &extension, const ExtensionCheck &check,
+                     const std::optional<std::string> &storagePath, const std::string &workingDirectory) {
+  if (!extension.start()) return;
+  if (checkSetup(extension, storagePath)) {
+    const URL storage = *URL::fileURLWithPath(*storagePath, true);
+    checkBadInput(extension, storage, workingDirectory);
+    std::optional<URL> first;
+    for (const KnownItem &item : knownItems(check)) {
+      const auto url = checkItem(extension, item, storage);
+      if (!first) first = url;
+    }
+    checkDescriptors(extension, first, storage);
+  }
+  extension.end(false);
+}
+
+/// What an extension is for, inside the sandbox that the daemon makes.
+void checkServing(CheckedExtension &extension, const ExtensionCheck &check,
+                  const std::optional<std::string> &storagePath) {
+  if (!extension.start()) return;
+  if (checkSetup(extension, storagePath)) {
+    const URL storage = *URL::fileURLWithPath(*storagePath, true);
+    for (const KnownItem &item : knownItems(check)) checkThatItemIsServed(extension, item, storage);
+  }
+  extension.end(false);
+}
+
 }  // namespace
 
 Result<std::vector<Finding>> checkExtension(const ExtensionCheck &check) {
@@ -100,32 +134,36 @@ Result<std::vector<Finding>> checkExtension(const ExtensionCheck &check) {
 
   const WorkingDirectory working;
   if (working.path().empty()) return posixError(errno, "making a temporary directory");
-  auto environment = commonEnvironment(working.path() + "/run");
-  if (!environment) return environment.error();
-  const auto container = groupContainer(check, *bundle->bundle, working.path());
+  const auto host = hostEnvironment(working.path());
+  if (!host) return host.error();
+  const auto container = groupContainer(check, *bundle->bundle, host.value().extensionPlaces);
   if (!container) return container.error();
-  std::optional<std::string> storagePath;
-  if (container.value()) storagePath = *container.value() + "/Storix Storage";
+  std::optional<std::string> storage;
+  if (container.value()) storage = *container.value() + "/Storix Storage";
 
-  CheckedExtension extension(
-      {*bundle, extensionProcessEnvironment(environment.value(), *bundle->bundle, container.value()), check.timeout,
-       check.takeOutputLine},
-      findings);
-  if (!extension.start()) return findings.all();
-  if (checkSetup(extension, storagePath)) {
-    const URL storage = *URL::fileURLWithPath(*storagePath, true);
-    checkBadInput(extension, storage, working.path());
-    std::optional<URL> first;
-    std::vector<KnownItem> items;
-    for (const std::string &identifier : check.items) items.push_back({identifier, ""});
-    for (const std::string &path : check.files) items.push_back({std::nullopt, path});
-    for (const KnownItem &item : items) {
-      const auto url = checkItem(extension, item, storage);
-      if (!first) first = url;
-    }
-    checkDescriptors(extension, first, storage);
+  CheckedExtension::Setting setting{
+      *bundle,
+      extensionProcessEnvironment(host.value().extensionEnvironment, *bundle->bundle, container.value()),
+      {},
+      check.timeout,
+      check.takeOutputLine};
+  CheckedExtension extension(setting, findings);
+  checkEverything(extension, check, storage, working.path());
+  if (findings.count(Severity::error) > 0) return findings.all();
+
+  // Now with nothing but what the daemon lets it have.
+  linuxhost::ExtensionConfinement confinement(host.value().confinementPlaces(), host.value().confinement);
+  linuxhost::ExtensionBundle confined = *bundle->bundle;
+  if (check.container && container.value()) confined.wishes.readWrite.push_back(*container.value());
+  setting.prepare = [&confinement, &confined](linuxhost::LaunchDescription &description) {
+    return confinement.confine(description, confined);
+  };
+  Findings inside;
+  CheckedExtension confinedExtension(setting, inside);
+  checkServing(confinedExtension, check, storage);
+  for (const Finding &finding : inside.all()) {
+    findings.error("Inside the sandbox in which the daemon runs it (\"KTSandbox\" asks for more): " + finding.sentence);
   }
-  extension.end(false);
   return findings.all();
 }
 

@@ -30,7 +30,7 @@ class CheckExtensionTest : public ::testing::Test {
     ::setenv("TMPDIR", directory_.c_str(), 1);
     check_.bundle = directory_ / "docs.appdex";
     fs::create_directories(bundle() / "documents/folder");
-    fs::create_symlink(STORIX_FAULTY_PROVIDER, bundle() / "provider");
+    fs::copy_file(STORIX_FAULTY_PROVIDER, bundle() / "provider");
     write("documents/a.txt", "the content of a document");
     write("documents/folder/b 100%.txt", "the content of another document");
     writeInfo();
@@ -58,10 +58,13 @@ class CheckExtensionTest : public ::testing::Test {
         {"KTExtensionPointIdentifier", R"("com.tessel.storix-nonui")"},
         {"KTExtension", R"({"KTExtensionStorixDocumentGroup": "group.org.sample.docs"})"}};
     std::string text;
+    bool isThere = entry.empty();
     for (const auto &[name, value] : entries) {
       if (name == key && entry.empty()) continue;
+      isThere = isThere || name == key;
       text += std::string(text.empty() ? "{" : ",") + "\"" + name + "\": " + (name == key ? entry : value) + "\n";
     }
+    if (!isThere) text += ",\"" + key + "\": " + entry;
     write("Info.kvs", text + "}");
   }
 
@@ -106,6 +109,17 @@ TEST_F(CheckExtensionTest, NothingIsFoundWhereNothingIsWrong) {
   check_.items = {"a.txt", "folder/b 100%.txt"};
   EXPECT_THAT(findingsWith("none"), IsEmpty());
   EXPECT_THAT(output_, Contains("the fault: none"));
+}
+
+TEST_F(CheckExtensionTest, WhatTheSandboxHidesIsNamed) {
+  const fs::path elsewhere = directory_ / "elsewhere";
+  fs::rename(bundle() / "documents", elsewhere);
+  fs::create_directory_symlink(elsewhere, bundle() / "documents");
+  EXPECT_THAT(findingsWithDocument("none"),
+              ElementsAre("error: Inside the sandbox in which the daemon runs it (\"KTSandbox\" asks for more): "
+                          "StartProvidingItemAtURL for the file \"a.txt\": no such document"));
+  writeInfo("KTSandbox", R"({"readOnly": [")" + elsewhere.string() + "\"]}");
+  EXPECT_THAT(findingsWithDocument("none"), IsEmpty());
 }
 
 TEST_F(CheckExtensionTest, AContainerThatIsGivenIsUsedAndKept) {

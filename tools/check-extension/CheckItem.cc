@@ -109,6 +109,7 @@ class ItemCheck {
   std::optional<URL> find(const KnownItem &item);
   bool identify(const URL &url, const std::optional<std::string> &known);
   void provide(const URL &url);
+  void provideOnce(const URL &url);
 
  private:
   /// The answer to a question that must succeed.
@@ -266,16 +267,31 @@ void ItemCheck::provide(const URL &url) {
   succeed(Operation::stopProviding, Value(url));
 }
 
+void ItemCheck::provideOnce(const URL &url) {
+  const MissingDirectories above(url.path());
+  NameWatch watch(url.path());
+  if (start(url, watch)) succeed(Operation::stopProviding, Value(url));
+}
+
+std::string subjectOf(const KnownItem &item) {
+  return item.identifier ? "the item \"" + *item.identifier + "\"" : "the file \"" + item.path + "\"";
+}
+
 }  // namespace
 
 std::optional<URL> checkItem(CheckedExtension &extension, const KnownItem &item, const URL &storage) {
-  ItemCheck check(extension, storage,
-                  item.identifier ? "the item \"" + *item.identifier + "\"" : "the file \"" + item.path + "\"");
+  ItemCheck check(extension, storage, subjectOf(item));
   const auto url = check.find(item);
   if (!url || !check.identify(*url, item.identifier)) return std::nullopt;
   check.identify(*url, item.identifier);
   check.provide(*url);
   return url;
+}
+
+void checkThatItemIsServed(CheckedExtension &extension, const KnownItem &item, const URL &storage) {
+  ItemCheck check(extension, storage, subjectOf(item));
+  const auto url = check.find(item);
+  if (url && check.identify(*url, item.identifier)) check.provideOnce(*url);
 }
 
 void checkDescriptors(CheckedExtension &extension, const std::optional<URL> &item, const URL &storage) {

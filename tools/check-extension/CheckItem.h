@@ -19,6 +19,9 @@ struct KnownItem {
 /// was ended in the middle, and watches its file meanwhile. Gives its URL where there is one to go on with.
 std::optional<URL> checkItem(CheckedExtension &extension, const KnownItem &item, const URL &storage);
 
+/// The short form: has the document identified, provided and dropped once.
+void checkThatItemIsServed(CheckedExtension &extension, const KnownItem &item, const URL &storage);
+
 /// Has the extension do the same things over and over, and looks whether it keeps descriptors open.
 void checkDescriptors(CheckedExtension &extension, const std::optional<URL> &item, const URL &storage);
 

@@ -24,6 +24,7 @@ bool CheckedExtension::start() {
   description.executable = setting_.bundle.executable;
   description.workingDirectory = setting_.bundle.bundle->path;
   description.environment = setting_.environment;
+  description.prepare = setting_.prepare;
   auto started = StartedExtension::start(std::move(description), setting_.takeOutputLine);
   if (!started) {
     noteFailure("The extension cannot be started: " + started.error().message());

@@ -22,6 +22,8 @@ class CheckedExtension {
   struct Setting {
     CheckedBundle bundle;
     std::vector<std::string> environment;
+    /// As of `LaunchDescription`; empty where nothing is to be changed.
+    std::function<std::optional<SXError>(linuxhost::LaunchDescription &)> prepare;
     std::chrono::milliseconds timeout{};
     std::function<void(std::string_view)> takeOutputLine;
   };

@@ -31,7 +31,7 @@ class BundleCheckTest : public CommandsTest {
     write("Info.kvs", R"({"KTBundleIdentifier": "org.sample.docs", "KTBundleExecutable": "provider",
                           "KTGroupContainers": ["group"], "KTExtensionPointIdentifier": "com.tessel.storix-nonui",
                           "KTExtension": {"KTExtensionStorixDocumentGroup": "group"}})");
-    fs::create_symlink(STORIX_FAULTY_PROVIDER, directory_ / "docs.appdex/provider");
+    fs::copy_file(STORIX_FAULTY_PROVIDER, directory_ / "docs.appdex/provider");
   }
   void TearDown() override {
     fs::remove_all(directory_);
