@@ -136,16 +136,7 @@ DocumentSync::Outcome DocumentSync::uploadOnce(const std::string &path, bool &ag
   ItemState done;
   done.hash = uploaded.value().hash;
   done.stamp = stamp;
-  done.etag = uploaded.value().etag;
-  done.version = withoutWeakness(done.etag);
-  if (done.etag.empty()) {
-    // Whatever has another length is not what was sent, and its version stays unknown.
-    const auto now = client_.entry(path, cancellation_);
-    if (now && now.value() && now.value()->size == stamp.size) {
-      done.etag = now.value()->etag;
-      done.version = now.value()->version();
-    }
-  }
+  setVersion(done, path, uploaded.value().etag);
   if (auto failed = states_.write(path, done)) return {failed, {}};
   const auto after = copies_.find(path);
   again = after && after.value() && after.value()->stamp != stamp;
@@ -225,18 +216,22 @@ Result<DocumentSync::Fetched> DocumentSync::download(const std::string &path, co
   return Fetched{std::move(downloaded.value()), std::move(file.value()), std::move(hash.value())};
 }
 
-std::optional<SXError> DocumentSync::remember(const std::string &path, const Fetched &fetched,
-                                              const FileStamp &stamp) const {
+std::optional<SXError> DocumentSync::remember(const std::string &path, const Fetched &fetched, const FileStamp &stamp) {
   ItemState state;
-  state.etag = fetched.download.etag;
-  DavEntry entry;
-  entry.etag = state.etag;
-  entry.modificationTime = fetched.download.modificationTime;
-  entry.size = stamp.size;
-  state.version = entry.version();
   state.hash = fetched.hash;
   state.stamp = stamp;
+  setVersion(state, path, fetched.download.etag);
   return states_.write(path, state);
+}
+
+void DocumentSync::setVersion(ItemState &state, const std::string &path, const std::string &etag) {
+  state.etag = etag;
+  state.version = withoutWeakness(etag);
+  if (!etag.empty()) return;
+  const auto now = client_.entry(path, cancellation_);
+  if (!now || !now.value() || now.value()->size != state.stamp.size) return;
+  state.etag = now.value()->etag;
+  state.version = now.value()->version();
 }
 
 }  // namespace storix::example

@@ -59,7 +59,10 @@ class DocumentSync {
   /// progress is told in the placeholder of what the server has announced.
   Result<Fetched> download(const std::string &path, const std::string &knownETag,
                            const std::optional<DavEntry> &announced = std::nullopt);
-  std::optional<SXError> remember(const std::string &path, const Fetched &fetched, const FileStamp &stamp) const;
+  std::optional<SXError> remember(const std::string &path, const Fetched &fetched, const FileStamp &stamp);
+  /// Where the server did not say of which version it spoke, it is asked for the version that it has now.
+  /// One of another length is not the one, and the version stays unknown.
+  void setVersion(ItemState &state, const std::string &path, const std::string &etag);
 
   DavClient &client_;
   const LocalCopies &copies_;

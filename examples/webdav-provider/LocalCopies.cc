@@ -77,13 +77,17 @@ Result<FileStamp> LocalCopies::place(const std::string &path, int partial, std::
   if (!parent) return parent.error();
   auto incoming = tree_.openIncoming();
   if (!incoming) return incoming.error();
+  const std::string name = lastComponent(path);
   if (modificationTime) {
     const std::array<timespec, 2> times{timespec{0, UTIME_OMIT}, timespec{*modificationTime, 0}};
     ::futimens(partial, times.data());
   }
   struct stat status {};
+  if (::fstatat(parent.value().get(), name.c_str(), &status, AT_SYMLINK_NOFOLLOW) == 0 && S_ISREG(status.st_mode) &&
+      ::fchmod(partial, status.st_mode & 0777U) != 0) {
+    return posixError(errno, "setting the permissions of \"" + path + "\"");
+  }
   if (::fstat(partial, &status) != 0) return posixError(errno, "looking at the download of \"" + path + "\"");
-  const std::string name = lastComponent(path);
   if (::fsync(partial) != 0 ||
       ::renameat2(incoming.value().get(), ItemStates::key(path).c_str(), parent.value().get(), name.c_str(),
                   replacing == Replacing::no ? RENAME_NOREPLACE : 0) != 0 ||

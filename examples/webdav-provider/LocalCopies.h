@@ -32,7 +32,8 @@ class LocalCopies {
   void discardForgotten(const ItemStates &states) const;
 
   enum class Replacing { no, yes };
-  /// Gives the complete download the item's name. EEXIST where there is a file and none is to be replaced.
+  /// Gives the complete download the item's name, and the permissions of what it replaces (0600 for a new
+  /// file). EEXIST where there is a file and none is to be replaced.
   /// The stamp is that of the file then.
   Result<FileStamp> place(const std::string &path, int partial, std::optional<time_t> modificationTime,
                           Replacing replacing) const;

@@ -44,8 +44,10 @@ TEST_F(LocalCopiesTest, AFileIsReplacedOnlyWhereThatIsWanted) {
   ASSERT_FALSE(refused.ok());
   EXPECT_EQ(refused.error().code(), EEXIST);
   EXPECT_EQ(read("a"), "mine");
+  fs::permissions(folder_.path("items/a"), fs::perms(0640));
   EXPECT_TRUE(copies().place("a", file.get(), {}, LocalCopies::Replacing::yes).ok());
   EXPECT_EQ(read("a"), "theirs");
+  EXPECT_EQ(fs::status(folder_.path("items/a")).permissions(), fs::perms(0640));
 }
 
 TEST_F(LocalCopiesTest, OfAPartOnlyWhatIsGoodIsKept) {

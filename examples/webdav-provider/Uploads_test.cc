@@ -150,6 +150,29 @@ TEST_F(Uploads, AnAnswerThatIsLostIsNoConflict) {
   EXPECT_THAT(proxy_.requests("PUT"), SizeIs(2));
 }
 
+TEST_F(Uploads, AVersionThatTheDownloadDidNotNameIsAskedFor) {
+  server_.write("a.txt", "hello");
+  proxy_.next({"GET", {}, {}, {}, "HTTP/1.1 200 OK\r\nContent-Length: 5\r\nConnection: close\r\n\r\nhello"});
+  ASSERT_EQ(start("a.txt"), succeeded);
+  change("a.txt", "mine");
+  ASSERT_EQ(changed("a.txt"), succeeded);
+  EXPECT_EQ(server_.read("a.txt"), "mine");
+  EXPECT_FALSE(isHere("a (conflict).txt"));
+}
+
+TEST_F(Uploads, AVersionThatCannotBeTheUploadedOneIsNotTakenForIt) {
+  provide("a.txt", "base");
+  change("a.txt", "mine");
+  proxy_.next({"PROPFIND", {}, {}, {}, {}});
+  // Somebody is quicker than the question after the upload.
+  proxy_.next({"PROPFIND", [this] { server_.write("a.txt", "somebody else's"); }, {}, {}, {}});
+  ASSERT_EQ(changed("a.txt"), succeeded);
+  change("a.txt", "mine again");
+  ASSERT_EQ(changed("a.txt"), succeeded);
+  EXPECT_EQ(server_.read("a.txt"), "somebody else's");
+  EXPECT_EQ(server_.read("a (conflict).txt"), "mine again");
+}
+
 TEST_F(Uploads, WhatWasRemovedOnTheServerIsMadeAgainByAChange) {
   provide("a.txt", "base");
   fs::remove(server_.path("a.txt"));
