@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include <memory>
 #include <sstream>
 
 #include "sdk/src/TestDaemon.h"
@@ -13,6 +14,9 @@ namespace storix::ctl {
 /// Runs verbs against a daemon that does as the test says, and collects what they print.
 class CommandsTest : public ::testing::Test {
  protected:
+  /// What the daemon's threads do may use members of the test.
+  void TearDown() override { daemon_.reset(); }
+
   ExitStatus run(const std::vector<std::string> &arguments,
                  std::chrono::milliseconds timeout = std::chrono::seconds(60)) {
     out_.str("");
@@ -21,17 +25,17 @@ class CommandsTest : public ::testing::Test {
     invocation.timeout = timeout;
     return runCommand(invocation, surroundings_);
   }
-  std::shared_ptr<sdk::ScriptedDaemon> scripted() { return daemon_.daemon; }
+  std::shared_ptr<sdk::ScriptedDaemon> scripted() { return daemon_->daemon; }
   std::string printed() const { return out_.str(); }
   std::string complaint() const { return err_.str(); }
 
-  sdk::TestDaemon daemon_;
+  std::unique_ptr<sdk::TestDaemon> daemon_ = std::make_unique<sdk::TestDaemon>();
   std::ostringstream out_;
   std::ostringstream err_;
   SteppedWaiting waiting_;
   Surroundings surroundings_{.currentDirectory = "/storage",
                              .homeDirectory = "",
-                             .clientOptions = {.runtimeDirectory = daemon_.directory()},
+                             .clientOptions = {.runtimeDirectory = daemon_->directory()},
                              .out = out_,
                              .err = err_,
                              .waiting = waiting_};

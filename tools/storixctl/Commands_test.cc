@@ -85,7 +85,7 @@ TEST_F(CommandsTest, NoAnswerInTimeIsStatusThree) {
 }
 
 TEST_F(CommandsTest, NoDaemonIsStatusThree) {
-  surroundings_.clientOptions.runtimeDirectory = daemon_.directory() + "/nowhere";
+  surroundings_.clientOptions.runtimeDirectory = daemon_->directory() + "/nowhere";
   EXPECT_EQ(run({"wake", "--json"}), daemonNotReachable);
   EXPECT_THAT(complaint(), HasSubstr("not running"));
   EXPECT_THAT(complaint(), HasSubstr("Start storixd"));
@@ -115,7 +115,7 @@ TEST_F(CommandsTest, BookmarksAreSharedAndResolved) {
 
 TEST_F(CommandsTest, NotifyPostsTheName) {
   std::string name;
-  daemon_.onPost = [&](const wire::MethodValues &values, const wire::BusConnection::Reply &reply) {
+  daemon_->onPost = [&](const wire::MethodValues &values, const wire::BusConnection::Reply &reply) {
     name = std::get<std::string>(values.at(0));
     reply.send({});
   };

@@ -5,8 +5,10 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <filesystem>
 #include <optional>
 #include <stop_token>
+#include <system_error>
 #include <thread>
 #include <utility>
 
@@ -79,15 +81,18 @@ class Transfer {
 
   Result<Printed> write() {
     auto url = documentURL(invocation_.operands[0], surroundings_.currentDirectory);
+    std::optional<Data> token;
     if (namesBookmark()) {
       auto document = resolve();
       if (!document) return document.error();
       url = document.value().url;
+      token = document.value().token;
     }
     if (!url) return url.error();
-    // All of the content is there before anybody has to wait for us.
     auto replacement = Replacement::of(url.value().path());
+    if (!replacement && token && isOutOfReach(replacement.error())) return writeThrough(*token, url.value());
     if (!replacement) return replacement.error();
+    // All of the content is there before anybody has to wait for us.
     const auto size = takeIn(replacement.value().descriptor());
     if (!size) return size.error();
 
@@ -96,8 +101,7 @@ class Transfer {
     if (!claim) return claim.error();
     if (!claim.value().isHeld()) return claimLost("nothing was written");
     if (auto failed = replacement.value().takePlace()) return *std::move(failed);
-    if (auto failed = endWriting(std::move(claim.value()))) return *std::move(failed);
-    return Printed{{{"URL", url.value()}, {"size", static_cast<std::int64_t>(size.value())}}, ""};
+    return written(url.value(), size.value(), std::move(claim.value()));
   }
 
  private:
@@ -202,7 +206,55 @@ class Transfer {
                    {{"description", "The daemon ended, and with it the claim on the document: " + consequence + "."}});
   }
 
+  /// Whether it is the document's directory that this process has no access to.
+  static bool isOutOfReach(const SXError &error) {
+    const auto code = error.code();
+    return error.domain() == posixErrorDomain &&
+           (code == EACCES || code == EPERM || code == EROFS || code == ENOENT || code == ENOTDIR);
+  }
+
+  /// For a process whose sandbox lets it do no more than the token: the content is written over the old
+  /// in place, once there is room for it.
+  Result<Printed> writeThrough(const Data &token, const URL &url) {
+    std::error_code noDirectory;
+    const auto directory = std::filesystem::temp_directory_path(noDirectory);
+    const UniqueFd content(::open(directory.c_str(), O_TMPFILE | O_RDWR | O_CLOEXEC, 0600));
+    if (!content) return posixError(errno, "making a temporary file in " + directory.string());
+    const auto size = takeIn(content.get());
+    if (!size) return size.error();
+    // What is written over must be there.
+    if (const auto provided = claimForReading(url); !provided) return provided.error();
+    auto claim = claimForWriting(url);
+    if (!claim) return claim.error();
+    const auto opened = openToken(token);
+    if (!opened) return opened.error();
+    if (!claim.value().isHeld()) return claimLost("nothing was written");
+    if (auto failed = overwrite(opened.value().get(), content.get(), size.value())) return *std::move(failed);
+    return written(url, size.value(), std::move(claim.value()));
+  }
+
+  static std::optional<SXError> overwrite(int document, int content, std::uint64_t size) {
+    const auto length = static_cast<off_t>(size);
+    // Not every file system can keep room; then it turns out when it is written.
+    if (length > 0 && ::fallocate(document, FALLOC_FL_KEEP_SIZE, 0, length) != 0 && errno == ENOSPC) {
+      return posixError(ENOSPC, "writing the document, of which nothing was changed");
+    }
+    ::lseek(content, 0, SEEK_SET);
+    // Begun, it is not interrupted: half of it would be neither the old nor the new content.
+    ProcessWaiting uninterrupted;
+    const auto copied =
+        ContentCopy{content, document, "the new content", "the document"}.run(uninterrupted, [](std::uint64_t) {});
+    if (!copied) return copied.error();
+    if (::ftruncate(document, length) != 0 || ::fsync(document) != 0) return posixError(errno, "writing the document");
+    return std::nullopt;
+  }
+
   /// Has the provider told of the change.
+  Result<Printed> written(const URL &url, std::uint64_t size, FileClaim claim) {
+    if (auto failed = endWriting(std::move(claim))) return *std::move(failed);
+    return Printed{{{"URL", url}, {"size", static_cast<std::int64_t>(size)}}, ""};
+  }
+
   std::optional<SXError> endWriting(FileClaim claim) {
     const auto ended = answer<bool>([this, &claim](const std::function<void(Result<bool>)> &handler) {
       ending_ = std::jthread([handler, claim = std::move(claim)]() mutable { handler(resultOf(claim.end())); });

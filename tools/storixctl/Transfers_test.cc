@@ -36,11 +36,11 @@ class TransfersTest : public CommandsTest {
   TransfersTest() {
     (void)::signal(SIGPIPE, SIG_IGN);
     surroundings_.currentDirectory = directory_.path().string();
-    daemon_.onBeginRead = beginning("read");
-    daemon_.onBeginWrite = beginning("write");
-    daemon_.onEndRead = ending("end of read");
-    daemon_.onEndWrite = ending("end of write");
-    daemon_.onConsume = [](const MethodValues &values, const Reply &reply) {
+    daemon_->onBeginRead = beginning("read");
+    daemon_->onBeginWrite = beginning("write");
+    daemon_->onEndRead = ending("end of read");
+    daemon_->onEndWrite = ending("end of write");
+    daemon_->onConsume = [](const MethodValues &values, const Reply &reply) {
       UniqueFd file(::open(std::get<Data>(values.at(0)).bytes.c_str(), O_RDWR | O_CLOEXEC));
       if (!file) return reply.fail(wire::platformError::unavailable, "it is not there");
       MethodValues answer;
@@ -134,7 +134,7 @@ TEST_F(TransfersTest, OpenPrintsTheContentOrWritesItToAFile) {
 }
 
 TEST_F(TransfersTest, OpenSaysWhyATokenIsRefused) {
-  daemon_.onConsume = [](const auto &, const Reply &reply) {
+  daemon_->onConsume = [](const auto &, const Reply &reply) {
     reply.fail(wire::platformError::invalidToken, "it was changed");
   };
   EXPECT_EQ(run({"open", "dG9rZW4="}), requestFailed);
@@ -142,7 +142,7 @@ TEST_F(TransfersTest, OpenSaysWhyATokenIsRefused) {
 }
 
 TEST_F(TransfersTest, ReadClaimsTheDocumentAndPrintsIt) {
-  daemon_.onBeginRead = [this](const MethodValues &values, const Reply &reply) {
+  daemon_->onBeginRead = [this](const MethodValues &values, const Reply &reply) {
     note("read " + std::get<std::string>(values.at(0)));
     directory_.write("a", "provided");
     give(reply);
@@ -169,7 +169,7 @@ TEST_F(TransfersTest, AClaimIsAskedForOnceTheDaemonKnowsItsProviders) {
 }
 
 TEST_F(TransfersTest, CatResolvesClaimsAndOpensWithTheToken) {
-  daemon_.onBeginRead = [this](const MethodValues &values, const Reply &reply) {
+  daemon_->onBeginRead = [this](const MethodValues &values, const Reply &reply) {
     note("read " + std::get<std::string>(values.at(0)));
     directory_.write("token's", "provided");
     give(reply);
@@ -219,7 +219,7 @@ TEST_F(TransfersTest, WhatIsNoDocumentIsNotRead) {
 }
 
 TEST_F(TransfersTest, TheProvidersErrorIsPrinted) {
-  daemon_.onBeginRead = [](const auto &, const Reply &reply) {
+  daemon_->onBeginRead = [](const auto &, const Reply &reply) {
     refuse(reply, SXPluginOperationFailedError(SXError("org.sample", 7, {{"description", "no network"}})));
   };
   EXPECT_EQ(run({"read", "a"}), requestFailed);
@@ -231,8 +231,8 @@ TEST_F(TransfersTest, TheProvidersErrorIsPrinted) {
 
 TEST_F(TransfersTest, ADeadlineThatPassesSaysWhatToDo) {
   const auto never = [](const auto &, const Reply &) {};
-  daemon_.onBeginRead = never;
-  daemon_.onBeginWrite = never;
+  daemon_->onBeginRead = never;
+  daemon_->onBeginWrite = never;
   directory_.write("a", "old");
   EXPECT_EQ(run({"read", "a"}, std::chrono::milliseconds(20)), daemonNotReachable);
   EXPECT_THAT(complaint(), HasSubstr("Its provider has not put it in place"));
@@ -278,6 +278,44 @@ TEST_F(TransfersTest, WriteTakesABookmarkableStringAndAFile) {
   EXPECT_EQ(directory_.read("a"), "from a file");
 }
 
+TEST_F(TransfersTest, ADocumentBeyondTheSandboxIsWrittenThroughItsToken) {
+  scripted()->onDocumentURL = [this](const auto &, const SXDaemon::DocumentReply &reply) {
+    reply(URL::fileURLWithPath("/beyond/our/sandbox"), Data{path("a")}, std::nullopt, std::nullopt, std::nullopt);
+  };
+  daemon_->onBeginRead = [this](const MethodValues &values, const Reply &reply) {
+    note("read " + std::get<std::string>(values.at(0)));
+    if (!fs::exists(directory_ / "a")) directory_.write("a", "much older content");
+    give(reply);
+  };
+  EXPECT_EQ(writeFrom("new", {"write", "storix:p/a", "--json"}), done) << complaint();
+  EXPECT_EQ(directory_.read("a"), "new");
+  EXPECT_THAT(printed(), HasSubstr("\"size\": 3"));
+  EXPECT_THAT(events(), testing::IsSupersetOf({"read file:///beyond/our/sandbox", "write file:///beyond/our/sandbox",
+                                               "end of write of new"}));
+  EXPECT_EQ(writeFrom("", {"write", "storix:p/a"}), done) << complaint();
+  EXPECT_EQ(directory_.read("a"), "");
+  EXPECT_EQ(writeFrom("longer than before", {"write", "storix:p/a"}), done) << complaint();
+  EXPECT_EQ(directory_.read("a"), "longer than before");
+  EXPECT_THAT(directory_.names(), ElementsAre("a"));
+}
+
+TEST_F(TransfersTest, BeyondTheSandboxTooInputThatFailsCostsNothing) {
+  scripted()->onDocumentURL = [this](const auto &, const SXDaemon::DocumentReply &reply) {
+    reply(URL::fileURLWithPath("/beyond/our/sandbox"), Data{path("a")}, std::nullopt, std::nullopt, std::nullopt);
+  };
+  directory_.write("a", "old");
+  const UniqueFd notReadable(::open(path("a").c_str(), O_WRONLY | O_CLOEXEC));
+  surroundings_.contentInput = notReadable.get();
+  EXPECT_EQ(run({"write", "storix:p/a"}), requestFailed);
+  EXPECT_EQ(directory_.read("a"), "old");
+  EXPECT_THAT(events(), IsEmpty());
+  scripted()->onDocumentURL = [](const auto &, const SXDaemon::DocumentReply &reply) {
+    reply(URL::fileURLWithPath("/beyond/our/sandbox"), std::nullopt, std::nullopt, std::nullopt, std::nullopt);
+  };
+  EXPECT_EQ(writeFrom("new", {"write", "storix:p/a"}), requestFailed);
+  EXPECT_THAT(complaint(), HasSubstr("opening the directory /beyond/our"));
+}
+
 TEST_F(TransfersTest, InputThatFailsCostsNothing) {
   directory_.write("a", "old");
   const UniqueFd notReadable(::open(path("a").c_str(), O_WRONLY | O_CLOEXEC));
@@ -301,8 +339,9 @@ TEST_F(TransfersTest, WhereNothingCanBeWrittenIsSaidBeforeInputIsTaken) {
 
 TEST_F(TransfersTest, ADaemonThatGoesBeforeTheProviderIsToldIsSaid) {
   directory_.write("a", "old");
-  daemon_.onEndWrite = [this](const auto &, const Reply &) {
-    std::thread([this] { daemon_.closeConnections(); }).detach();
+  std::jthread closing;
+  daemon_->onEndWrite = [this, &closing](const auto &, const Reply &) {
+    closing = std::jthread([this] { daemon_->closeConnections(); });
   };
   EXPECT_EQ(writeFrom("new", {"write", "a"}), daemonNotReachable);
   EXPECT_THAT(complaint(), HasSubstr("may not have heard of it"));
@@ -310,7 +349,7 @@ TEST_F(TransfersTest, ADaemonThatGoesBeforeTheProviderIsToldIsSaid) {
 }
 
 TEST_F(TransfersTest, AnInterruptionEndsAReadThatWaits) {
-  daemon_.onBeginRead = [this](const auto &, const Reply &) { waiting_.interrupt(); };
+  daemon_->onBeginRead = [this](const auto &, const Reply &) { waiting_.interrupt(); };
   EXPECT_EQ(run({"read", "a", "-o", path("copy")}), 128 + SIGINT);
   EXPECT_THAT(complaint(), IsEmpty());
   EXPECT_THAT(directory_.names(), IsEmpty());
@@ -318,7 +357,7 @@ TEST_F(TransfersTest, AnInterruptionEndsAReadThatWaits) {
 
 TEST_F(TransfersTest, AnInterruptionEndsAWriteThatWaitsAndKeepsTheOldContent) {
   directory_.write("a", "old");
-  daemon_.onBeginWrite = [this](const auto &, const Reply &) { waiting_.interrupt(); };
+  daemon_->onBeginWrite = [this](const auto &, const Reply &) { waiting_.interrupt(); };
   EXPECT_EQ(writeFrom("new", {"write", "a"}), 128 + SIGINT);
   EXPECT_EQ(directory_.read("a"), "old");
   EXPECT_THAT(directory_.names(), ElementsAre("a"));
@@ -340,7 +379,7 @@ TEST_F(TransfersTest, WaitingForTheProviderIsShownOnATerminal) {
   surroundings_.terminal = terminal.descriptor();
   std::optional<Reply> reading;
   std::mutex mutex;
-  daemon_.onBeginRead = [&](const auto &, const Reply &reply) {
+  daemon_->onBeginRead = [&](const auto &, const Reply &reply) {
     const std::lock_guard lock(mutex);
     reading = reply;
   };
