@@ -134,8 +134,9 @@ void Claims::endNow(const std::shared_ptr<Claim> &claim, EndHandler handler) {
   connection->bus->call(wire::fileCoordinationInterface(), methodToEnd(claim->kind()), std::move(values),
                         [self = shared_from_this(), claim, pending](const wire::MethodResult &result) {
                           const auto *failure = std::get_if<wire::MethodFailure>(&result);
-                          // Of a connection that ended its claims are lost, this one among them.
                           if (failure && failure->name == wire::busErrorName::disconnected) {
+                            // All of its claims are lost, this one among them.
+                            if (const auto closed = claim->connection.lock()) self->drop(closed);
                             return pending->finish(claimLostError());
                           }
                           if (claim->state == Claim::State::ending) claim->state = Claim::State::ended;
