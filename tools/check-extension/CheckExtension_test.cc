@@ -358,6 +358,16 @@ TEST_F(CheckExtensionTest, APlaceholderInTheDocumentsPlaceIsNamed) {
                     Contains(HasSubstr("answered the document's own URL"))));
 }
 
+TEST_F(CheckExtensionTest, APlaceholderThatNobodyCanUseIsNamed) {
+  const auto found = [this](const std::string &fault) { return findingsWithDocument(fault); };
+  EXPECT_THAT(found("hides the placeholder"), ElementsAre(HasSubstr("is only found beside the document")));
+  EXPECT_THAT(found("writes an odd placeholder"), ElementsAre(HasSubstr("nobody can read the placeholder: ")));
+  EXPECT_THAT(found("leaves out the size"), ElementsAre(HasSubstr("needs the number \"size\"")));
+  EXPECT_THAT(found("is wrong about the size"),
+              ElementsAre("error: ProvidePlaceholderAtURL for the file \"a.txt\": the placeholder says that the "
+                          "document has 1 bytes, and it has 25."));
+}
+
 TEST_F(CheckExtensionTest, APlaceholderThatIsNotThereIsNamed) {
   EXPECT_THAT(findingsWithDocument("makes up a placeholder"), Contains(HasSubstr("where there is no file")));
 }

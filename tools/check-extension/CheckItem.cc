@@ -7,6 +7,7 @@
 
 #include <array>
 #include <cerrno>
+#include <cstdint>
 #include <cstring>
 #include <filesystem>
 #include <memory>
@@ -15,6 +16,7 @@
 #include <vector>
 
 #include "platform/SXError.h"
+#include "platform/linux/KeyedValueFile.h"
 #include "tools/check-extension/CheckBadInput.h"
 #include "wire/UniqueFd.h"
 
@@ -118,6 +120,7 @@ class ItemCheck {
     extension_.findings().error(std::string(operationName(operation)) + " for " + subject_ + ": " + sentence);
   }
   void checkPlaceholder(const URL &url);
+  void readPlaceholder(const URL &placeholder, const URL &url);
   /// Whether the file is complete and stays so.
   bool start(const URL &url, NameWatch &watch);
   void checkContent(const URL &url, const std::string &when);
@@ -127,6 +130,7 @@ class ItemCheck {
   const std::string subject_;
   std::optional<std::string> identifier_;
   std::optional<Checksum> content_;
+  std::optional<std::int64_t> announcedSize_;
 };
 
 std::optional<ExtensionAnswer> ItemCheck::succeed(Operation operation, const Argument &argument) {
@@ -207,7 +211,30 @@ void ItemCheck::checkPlaceholder(const URL &url) {
           "answered " + answer->url->absoluteString() + ", which does not lie in the provided-items directory.");
   } else if (!fs::is_regular_file(answer->url->path(), failed)) {
     error(Operation::providePlaceholder, "answered " + answer->url->absoluteString() + ", where there is no file.");
+  } else {
+    readPlaceholder(*answer->url, url);
   }
+}
+
+void ItemCheck::readPlaceholder(const URL &placeholder, const URL &url) {
+  const std::string what = "ProvidePlaceholderAtURL for " + subject_ + ": ";
+  if (placeholder != url.deletingLastPathComponent().appendingPathComponent("." + url.lastPathComponent())) {
+    extension_.findings().advice(what +
+                                 "the placeholder is only found beside the document, under its name with \".\" "
+                                 "in front.");
+  }
+  const auto content = linuxhost::readKeyedValueFile(placeholder.path());
+  if (!content) {
+    extension_.findings().advice(what + "nobody can read the placeholder: " + content.error().message());
+    return;
+  }
+  const auto size = content.value().find("size");
+  const std::int64_t *bytes = size == content.value().end() ? nullptr : size->second.integer();
+  if (!bytes || *bytes < 0) {
+    extension_.findings().advice(what + "a placeholder needs the number \"size\", the bytes of the document.");
+    return;
+  }
+  announcedSize_ = *bytes;
 }
 
 void ItemCheck::checkContent(const URL &url, const std::string &when) {
@@ -221,6 +248,13 @@ void ItemCheck::checkContent(const URL &url, const std::string &when) {
     error(Operation::startProviding, when + ", the file's content is not the one that was there at first.");
   }
   content_ = checksum;
+  std::error_code failed;
+  const auto size = fs::file_size(url.path(), failed);
+  if (announcedSize_ && !failed && static_cast<std::uintmax_t>(*announcedSize_) != size) {
+    error(Operation::providePlaceholder, "the placeholder says that the document has " +
+                                             std::to_string(*announcedSize_) + " bytes, and it has " +
+                                             std::to_string(size) + ".");
+  }
 }
 
 bool ItemCheck::start(const URL &url, NameWatch &watch) {

@@ -106,7 +106,12 @@ int providePlaceholder(sd_bus_message *message, void *, sd_bus_error *) {
   }
   fs::path place = (storage / *path).parent_path() / ("." + (storage / *path).filename().string());
   if (is("puts the placeholder in the document's place")) place = storage / *path;
-  if (!is("makes up a placeholder")) writeFile(place, "placeholder");
+  if (is("hides the placeholder")) place += ".placeholder";
+  std::string text = "{\"size\":" + std::to_string(fs::file_size(documents / *path)) + "}";
+  if (is("writes an odd placeholder")) text = "a placeholder";
+  if (is("leaves out the size")) text = "{}";
+  if (is("is wrong about the size")) text = "{\"size\":1}";
+  if (!is("makes up a placeholder")) writeFile(place, text);
   return sd_bus_reply_method_return(message, "asa(sxa{sv})", 1,
                                     URL::fileURLWithPath(place.string())->absoluteString().c_str(), 0);
 }
