@@ -1,6 +1,7 @@
 #include "platform/linux/Sandbox.h"
 
 #include <gmock/gmock.h>
+#include <sodium.h>
 #include <sys/mman.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
@@ -268,6 +269,26 @@ TEST_F(SandboxTest, TokenOutlivesTheDaemonButNotItsKey) {
   EXPECT_EQ(failureOf(*token), Kind::invalidToken);
   EXPECT_EQ(failureOf(""), Kind::invalidToken);
   EXPECT_EQ(failureOf(std::string("\0\xFF", 2)), Kind::invalidToken);
+}
+
+TEST_F(SandboxTest, ForgedTokenIsRefusedBeforeAnythingThatItSaysIsLookedAt) {
+  // All of a token's form, and naming what a true one would open or make.
+  const std::string payload = "w" + std::string(16, 'r') + storage_ + "/.companion";
+  const auto encoded = [](const std::string &bytes) {
+    std::string text(sodium_base64_encoded_len(bytes.size(), sodium_base64_VARIANT_URLSAFE_NO_PADDING), '\0');
+    sodium_bin2base64(text.data(), text.size(), reinterpret_cast<const unsigned char *>(bytes.data()), bytes.size(),
+                      sodium_base64_VARIANT_URLSAFE_NO_PADDING);
+    text.pop_back();
+    return text;
+  };
+  TestLog log;
+  for (const std::string &mac : {std::string(32, '\0'), std::string(32, '\xFF'), std::string(), std::string(31, 'm')}) {
+    const auto [kind, text] = consumed("storix1." + encoded(payload) + "." + encoded(mac));
+    EXPECT_EQ(kind, Kind::invalidToken);
+    EXPECT_EQ(text, "The token was not made here, or before the system was last started. Ask for a new one.");
+  }
+  EXPECT_FALSE(std::filesystem::exists(storage_ + "/.companion"));
+  EXPECT_THAT(log.take(), ElementsAre());
 }
 
 TEST_F(SandboxTest, OnlyWhatLiesInAGroupContainerGetsAToken) {
