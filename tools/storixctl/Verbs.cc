@@ -136,8 +136,9 @@ std::span<const VerbDescription> verbs() {
        "check-extension",
        "tell what is wrong with a document provider's bundle",
        "Starts the provider as the daemon would, but without a daemon and in a fresh group container,\n"
-       "and asks it for everything good and bad that may be asked. Prints errors and advice, and what\n"
-       "the provider prints. Name documents of the provider, or only bad input can be tried. They are\n"
+       "and asks it for everything good and bad that may be asked; then, if nothing was wrong, once\n"
+       "more inside the sandbox in which the daemon runs it. Prints errors and advice, and what the\n"
+       "provider prints. Name documents of the provider, or only bad input can be tried. They are\n"
        "downloaded and dropped, and not changed. Exit status 1 where there are errors.\n",
        {{"BUNDLE", "the bundle, NAME.appdex"}},
        {Option::item, Option::file, Option::container}},
