@@ -62,6 +62,29 @@ TEST_F(OpenDocument, ForWritingIsHeldUntilTheClaimEndsAndTheProviderHearsOfIt) {
   EXPECT_EQ("newtents of report", Session::read(session.storage(provider) / "report"));
 }
 
+TEST_F(OpenDocument, IsSharedByAConfinedProcessThatProvesByItselfThatItMayWrite) {
+  session.installProvider(provider);
+  serve();
+  const std::unique_ptr<Client> client = makeClient();
+  grantAndStart(*client, provider, "report");
+  const fs::path report = session.storage(provider) / "report";
+  const std::string tool = session.installApplication("org.sample.confined", builtProgram("storixctl")).string();
+  // No new privileges: nobody can tell from outside what such a process may write.
+  const auto share = [&] {
+    return run({"setpriv", "--no-new-privs", tool, "share", report.string(), "org.sample.files"}, session.environment);
+  };
+  const Finished shared = share();
+  EXPECT_EQ(0, shared.status) << shared.errors;
+  EXPECT_TRUE(client->openDocument("storix:org.sample.docs/report", {.deadline = patience}));
+
+  // What it cannot open for writing it cannot prove, and may not share: a directory in the file's place.
+  fs::remove(report);
+  fs::create_directory(report);
+  const Finished refused = share();
+  EXPECT_EQ(1, refused.status);
+  EXPECT_NE(std::string::npos, refused.errors.find("may not have this document")) << refused.errors;
+}
+
 TEST_F(OpenDocument, NotSharedWithTheCallerIsRefused) {
   session.installProvider(provider);
   serve();
