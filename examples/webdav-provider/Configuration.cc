@@ -62,8 +62,8 @@ Result<HttpCredentials> readCredentials(const std::string &file) {
   // The parser's words stay out: they must not quote a password.
   const auto values = KeyedValues::parse(text.value());
   if (!values) return wrong(file, R"(it must look like {"Name": "...", "Password": "..."})");
-  auto name = values.value().string("Name");
-  auto password = values.value().string("Password");
+  auto name = values->string("Name");
+  auto password = values->string("Password");
   if (!name || name->empty() || !password) return wrong(file, R"("Name" and "Password" must be texts)");
   if (name->find(':') != std::string::npos) return wrong(file, "a name cannot hold a colon");
   return HttpCredentials{*std::move(name), *std::move(password)};
@@ -77,9 +77,10 @@ Result<DavSettings> readConfiguration(const std::string &groupContainer) {
   if (!opened) return posixError(errno, "opening " + file + ", which must name the server's \"URL\"");
   const auto text = readWhole(opened.get(), fileAtMost);
   if (!text) return posixError(static_cast<int>(text.error().code()), "reading " + file);
-  const auto parsed = KeyedValues::parse(text.value());
-  if (!parsed) return wrong(file, parsed.error().message());
-  const KeyedValues &values = parsed.value();
+  std::string reason;
+  const auto parsed = KeyedValues::parse(text.value(), &reason);
+  if (!parsed) return wrong(file, reason);
+  const KeyedValues &values = *parsed;
 
   const auto address = values.string("URL");
   if (!address || address->empty()) return wrong(file, "\"URL\" must be the address of the WebDAV folder");

@@ -100,7 +100,7 @@ TEST_F(ConfigurationTest, OddCredentialsAreRefusedAndNotQuoted) {
 TEST_F(ConfigurationTest, OddConfigurationsAreRefusedWithAReason) {
   EXPECT_THAT(refusal(), HasSubstr("\"URL\""));
   const std::pair<const char *, const char *> refused[] = {
-      {"", "WebDAV.kvs"},
+      {"", "WebDAV.kvs: at byte 0"},
       {"[]", "not a dictionary"},
       {"{}", "\"URL\""},
       {R"({"URL": 1})", "\"URL\""},

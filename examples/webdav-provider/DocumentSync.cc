@@ -19,6 +19,19 @@ constexpr int uploadsAtMost = 6;
 constexpr std::chrono::milliseconds untilSure{1100};
 constexpr int waitsForSureness = 2;
 
+/// Not where the server's answers do not fit what is there, and not where there is no room for it.
+bool canGoOnAfter(const SXError &error) {
+  switch (error.code()) {
+    case EPROTO:
+    case ENOSPC:
+    case EDQUOT:
+    case EFBIG:
+      return false;
+    default:
+      return true;
+  }
+}
+
 bool isWeak(const std::string &etag) { return etag.starts_with("W/"); }
 
 }  // namespace
@@ -200,11 +213,10 @@ Result<DocumentSync::Fetched> DocumentSync::download(const std::string &path, co
   }
   auto downloaded = client_.download(path, knownETag, partial, cancellation_);
   if (!downloaded) {
-    // What the server's answers cannot continue is of no use.
-    const bool keep = downloaded.error().code() != EPROTO && ::fdatasync(partial.file) == 0;
+    const bool keep = canGoOnAfter(downloaded.error()) && ::fdatasync(partial.file) == 0;
     state.partialETag = keep ? partial.etag : "";
     state.partialLength = keep ? partial.length : 0;
-    if (auto failed = states_.write(path, state)) copies_.discardPartial(path);
+    if (states_.write(path, state) || !keep) copies_.discardPartial(path);
     return downloaded.error();
   }
   if (downloaded.value().isUnchanged) {

@@ -1,6 +1,9 @@
 // Documents on their way from a real server, and what may go wrong there.
 
+#include <sys/resource.h>
+
 #include <atomic>
+#include <csignal>
 #include <fstream>
 #include <thread>
 
@@ -177,6 +180,22 @@ TEST_F(Downloads, AnEncodingThatWasNotAskedForIsRefused) {
                "HTTP/1.1 200 OK\r\nContent-Encoding: gzip\r\nContent-Length: 3\r\nConnection: close\r\n\r\nabc"});
   EXPECT_THAT(start("a"), failsWith(EPROTO, "gzip"));
   EXPECT_FALSE(isHere("a"));
+}
+
+TEST_F(Downloads, WhatDoesNotFitIsDropped) {
+  server_.write("film", longContent());
+  provider();
+  rlimit before{};
+  ASSERT_EQ(::getrlimit(RLIMIT_FSIZE, &before), 0);
+  const rlimit small{100'000, before.rlim_max};
+  const auto handler = ::signal(SIGXFSZ, SIG_IGN);
+  ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &small), 0);
+  const auto failed = start("film");
+  ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &before), 0);
+  ::signal(SIGXFSZ, handler);
+  EXPECT_THAT(failed, failsWith(EFBIG));
+  EXPECT_FALSE(isHere("film"));
+  EXPECT_TRUE(nothingHalfDownloaded());
 }
 
 TEST_F(Downloads, ASilentServerIsGivenUpAfterAWhile) {

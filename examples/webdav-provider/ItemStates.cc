@@ -66,8 +66,8 @@ std::optional<ItemState> ItemStates::readByKey(const std::string &key) const {
   if (!text) return std::nullopt;
   const auto values = KeyedValues::parse(text.value());
   if (!values) return std::nullopt;
-  const auto string = [&values](const char *name) { return values.value().string(name).value_or(""); };
-  const auto number = [&values](const char *name) { return values.value().integer(name).value_or(0); };
+  const auto string = [&values](const char *name) { return values->string(name).value_or(""); };
+  const auto number = [&values](const char *name) { return values->integer(name).value_or(0); };
   ItemState state;
   state.etag = string("etag");
   state.version = string("version");

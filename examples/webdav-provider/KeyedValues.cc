@@ -8,16 +8,18 @@
 
 namespace storix::example {
 
-Result<KeyedValues> KeyedValues::parse(std::string_view text) {
+std::optional<KeyedValues> KeyedValues::parse(std::string_view text, std::string *outReason) {
   KeyedValues values;
   values.document_.Parse<rapidjson::kParseValidateEncodingFlag | rapidjson::kParseIterativeFlag>(text.data(),
                                                                                                  text.size());
-  if (values.document_.HasParseError()) {
-    return posixError(EINVAL, std::string(rapidjson::GetParseError_En(values.document_.GetParseError())) + " At byte " +
-                                  std::to_string(values.document_.GetErrorOffset()));
+  if (!values.document_.HasParseError() && values.document_.IsObject()) return values;
+  if (outReason && values.document_.HasParseError()) {
+    *outReason = "at byte " + std::to_string(values.document_.GetErrorOffset()) + ": " +
+                 rapidjson::GetParseError_En(values.document_.GetParseError());
+  } else if (outReason) {
+    *outReason = "it is not a dictionary";
   }
-  if (!values.document_.IsObject()) return posixError(EINVAL, "It is not a dictionary");
-  return values;
+  return std::nullopt;
 }
 
 std::optional<std::string> KeyedValues::string(const char *key) const {

@@ -14,8 +14,8 @@ namespace storix::example {
 /// The dictionary of a keyed-value file, with the few kinds of values that the provider's files hold.
 class KeyedValues {
  public:
-  /// Or what is wrong with the text.
-  static Result<KeyedValues> parse(std::string_view text);
+  /// None where the text is no dictionary; then the reason says what is wrong.
+  static std::optional<KeyedValues> parse(std::string_view text, std::string *outReason = nullptr);
 
   /// Absent where the key is missing, or its value of another kind.
   [[nodiscard]] std::optional<std::string> string(const char *key) const;

@@ -140,9 +140,10 @@ std::vector<std::string> LocalCopies::items() const {
   for (std::filesystem::recursive_directory_iterator entry(directory_, failed), end; !failed && entry != end;
        entry.increment(failed)) {
     std::string path = entry->path().string().substr(directory_.size() + 1);
+    std::error_code gone;
     if (FolderTree::checkPath(path)) {
       entry.disable_recursion_pending();
-    } else if (entry->symlink_status(failed).type() == std::filesystem::file_type::regular) {
+    } else if (entry->symlink_status(gone).type() == std::filesystem::file_type::regular) {
       found.push_back(std::move(path));
     }
   }

@@ -14,8 +14,7 @@ namespace {
 
 bool isPlaceholder(std::string_view text) {
   const auto values = KeyedValues::parse(text);
-  return values && values.value().string("name") &&
-         (values.value().integer("size") || values.value().integer("modificationTime"));
+  return values && values->string("name") && (values->integer("size") || values->integer("modificationTime"));
 }
 
 }  // namespace
