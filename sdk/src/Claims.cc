@@ -106,7 +106,7 @@ void Claims::answered(const std::shared_ptr<Claim> &claim, const PendingClaim &p
   release(claim);
   if (!values) return pending->finish(clientErrorOf(std::get<wire::MethodFailure>(result)));
   auto *error = std::get_if<std::optional<SXError>>(&values->at(0));
-  if (error && *error) return pending->finish(**std::move(error));
+  if (error && *error) return pending->finish(std::move(**error));
   pending->finish(incompleteAnswer("The answer holds no claim."));
 }
 
