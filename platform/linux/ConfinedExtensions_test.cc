@@ -293,6 +293,33 @@ TEST_F(ConfinedExtensionTest, ProcessThatOutlivesItsConnectionIsEndedByTheSignal
   EXPECT_TRUE(process.waitForExit());
 }
 
+TEST_F(ConfinedExtensionTest, TerminationSignalReachesTheProgramItself) {
+  const Record extension = installedRecord("cleans-up");
+  const RequestIdentifier request = beginWell(extension);
+  const Watched process(startedProcess());
+  extension->cancelExtensionRequest(request);
+  time_.advance(10s);
+  ASSERT_TRUE(time_.waitForTaskIn(5s));
+  time_.advance(5s);
+  EXPECT_TRUE(process.waitForExit());
+  // Its output is read to the end when it is reaped.
+  host_.reset();
+  EXPECT_THAT(linesWith("cleaned up"), ElementsAre("[NOTICE] Extension org.cleans-up: cleaned up"));
+}
+
+TEST_F(ConfinedExtensionTest, ProcessThatIgnoresTheTerminationSignalIsKilled) {
+  const Record extension = installedRecord("ignores-termination");
+  const RequestIdentifier request = beginWell(extension);
+  const Watched process(confinedProcess());
+  extension->cancelExtensionRequest(request);
+  time_.advance(10s);
+  ASSERT_TRUE(time_.waitForTaskIn(10s));
+  time_.advance(5s);
+  EXPECT_TRUE(process.isRunning());
+  time_.advance(5s);
+  EXPECT_TRUE(process.waitForExit());
+}
+
 TEST_F(ConfinedExtensionTest, WhatItHasStartedEndsWithIt) {
   const Record extension = installedRecord("answers");
   const RequestIdentifier request = beginWell(extension);

@@ -14,6 +14,7 @@
 #include <chrono>
 #include <climits>
 #include <csignal>
+#include <fstream>
 #include <utility>
 
 #include "platform/Log.h"
@@ -90,6 +91,21 @@ std::string wordsOf(int output) {
   return text;
 }
 
+std::vector<pid_t> childrenOf(pid_t process) {
+  const std::string number = std::to_string(process);
+  std::ifstream file("/proc/" + number + "/task/" + number + "/children");
+  std::vector<pid_t> children;
+  for (pid_t child = 0; file >> child;) children.push_back(child);
+  return children;
+}
+
+/// Bubblewrap's process has one child, the first process of the sandbox, which starts the program and
+/// takes on whom its parent has left.
+std::vector<pid_t> confinedProcesses(pid_t process) {
+  const std::vector<pid_t> first = childrenOf(process);
+  return first.empty() ? first : childrenOf(first.front());
+}
+
 /// Empty when the process ended well, else what is wrong. An error when nothing can be said.
 Result<std::string> outcomeOf(const LaunchedProcess &process, const std::string &program) {
   pollfd exit{process.pidfd.get(), POLLIN, 0};
@@ -116,6 +132,18 @@ Result<std::string> outcomeOf(const LaunchedProcess &process, const std::string 
 }
 
 }  // namespace
+
+bool signalConfined(pid_t process, int signal) {
+  bool isSent = false;
+  for (const pid_t found : confinedProcesses(process)) {
+    const UniqueFd pidfd(static_cast<int>(::syscall(SYS_pidfd_open, found, 0)));
+    // Whoever has got the number meanwhile is in the sandbox too, or is left alone.
+    const std::vector<pid_t> now = confinedProcesses(process);
+    if (!pidfd || std::find(now.begin(), now.end(), found) == now.end()) continue;
+    if (::syscall(SYS_pidfd_send_signal, pidfd.get(), signal, nullptr, 0) == 0) isSent = true;
+  }
+  return isSent;
+}
 
 struct ExtensionConfinement::Grant {
   std::string where;

@@ -1,5 +1,7 @@
 #pragma once
 
+#include <sys/types.h>
+
 #include <optional>
 #include <string>
 #include <vector>
@@ -9,6 +11,10 @@
 #include "platform/linux/ExtensionLauncher.h"
 
 namespace storix::linuxhost {
+
+/// Sends a signal to what runs confined below that process, which must be bubblewrap's and not be reaped.
+/// False when there is nothing yet, or it cannot be found out.
+[[nodiscard]] bool signalConfined(pid_t process, int signal);
 
 /// What becomes of extensions where bubblewrap is not there, or does not work.
 enum class ConfinementPolicy {

@@ -15,6 +15,7 @@
 #include <utility>
 
 #include "platform/Log.h"
+#include "platform/linux/ExtensionConfinement.h"
 #include "platform/linux/HostErrors.h"
 
 namespace storix::linuxhost {
@@ -250,6 +251,8 @@ void ExtensionProcess::sendSignal(int signal) {
   if (isGone_ || !pidfd_) return;
   sx_default_log().info("[INFO] Ending process %d of the extension %@ with signal %@.", processIdentifier_, name_,
                         signalText(signal));
+  // The program itself is asked to end; the end of the one that confines it would kill it.
+  if (isConfined_ && signal != SIGKILL && signalConfined(processIdentifier_, signal)) return;
   ::syscall(SYS_pidfd_send_signal, pidfd_.get(), signal, nullptr, 0);
 }
 

@@ -243,9 +243,15 @@ int main(int, char **arguments) {
     ::close(socket);
     waitForSignal();
   }
+  if (behaviour == "cleans-up") {
+    ::signal(SIGTERM, [](int) {
+      static_cast<void>(!::write(STDERR_FILENO, "cleaned up\n", 11));
+      ::_exit(0);
+    });
+  }
   if (behaviour == "ignores-termination") ::signal(SIGTERM, SIG_IGN);
   ::signal(SIGUSR1, [](int) { ::_exit(0); });
   serve(socket);
-  if (behaviour == "stays" || behaviour == "ignores-termination") waitForSignal();
+  if (behaviour == "stays" || behaviour == "cleans-up" || behaviour == "ignores-termination") waitForSignal();
   return 0;
 }
