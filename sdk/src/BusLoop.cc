@@ -17,8 +17,10 @@ namespace {
 /// How long poll may wait, rounded up so that it never returns just before the time.
 int millisecondsUntil(std::optional<BusLoop::Clock::time_point> time) {
   if (!time) return -1;
-  const auto remaining = std::chrono::ceil<std::chrono::milliseconds>(*time - BusLoop::Clock::now()).count();
-  return static_cast<int>(std::clamp<std::int64_t>(remaining, 0, 3'600'000));
+  const auto now = BusLoop::Clock::now();
+  if (*time <= now) return 0;
+  const auto remaining = std::chrono::ceil<std::chrono::milliseconds>(*time - now).count();
+  return static_cast<int>(std::min<std::int64_t>(remaining, 3'600'000));
 }
 
 }  // namespace
