@@ -355,15 +355,17 @@ TEST_F(ServedExtensionTest, CallsUnderWayLearnThatTheDaemonHasGone) {
 }
 
 TEST_F(ServedExtensionTest, WorkThatAnswersLaterIsToldWhenTheDaemonHasGone) {
+  std::promise<void> begun;
   std::promise<void> told;
   std::optional<std::stop_callback<std::function<void()>>> registered;
   ProviderExtension::Completion kept;
   extension_->onStart = [&](const URL &, const ProviderExtension::Completion &completion) {
     kept = completion;
     registered.emplace(extension_->cancellation(), [&told] { told.set_value(); });
+    begun.set_value();
   };
   vendor_->_startProvidingItemAtURL(item("a"), {});
-  identifier(item("a"));
+  begun.get_future().wait();
   connection_->close();
   EXPECT_EQ(served_.get(), 0);
   EXPECT_EQ(told.get_future().wait_for(std::chrono::seconds(60)), std::future_status::ready);
