@@ -7,6 +7,7 @@
 
 #include <array>
 #include <csignal>
+#include <future>
 #include <mutex>
 #include <thread>
 
@@ -339,10 +340,12 @@ TEST_F(TransfersTest, WhereNothingCanBeWrittenIsSaidBeforeInputIsTaken) {
 
 TEST_F(TransfersTest, ADaemonThatGoesBeforeTheProviderIsToldIsSaid) {
   directory_.write("a", "old");
-  std::jthread closing;
-  daemon_->onEndWrite = [this, &closing](const auto &, const Reply &) {
-    closing = std::jthread([this] { daemon_->closeConnections(); });
-  };
+  std::promise<void> ending;
+  daemon_->onEndWrite = [&ending](const auto &, const Reply &) { ending.set_value(); };
+  std::jthread closing([this, asked = ending.get_future()] {
+    EXPECT_EQ(asked.wait_for(std::chrono::seconds(60)), std::future_status::ready);
+    daemon_->closeConnections();
+  });
   EXPECT_EQ(writeFrom("new", {"write", "a"}), daemonNotReachable);
   EXPECT_THAT(complaint(), HasSubstr("may not have heard of it"));
   EXPECT_EQ(directory_.read("a"), "new");
