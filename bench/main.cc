@@ -1,0 +1,92 @@
+// storix_bench [--quick] [--only PART]... [--into FILE]
+//   --quick  everything once and shortly, without bounds: does it still run?
+//   --only   floors, requests, claims, store, queues, registry, start-up, memory or peers
+//   --into   puts the table into a page, between the lines that mark its place
+
+#include <algorithm>
+#include <cstdio>
+#include <fstream>
+#include <iterator>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "bench/Benchmarks.h"
+
+namespace {
+
+using storix::bench::Table;
+
+struct Part {
+  std::string_view name;
+  void (*measure)(Table &);
+  bool inQuickForm;
+};
+
+constexpr Part parts[] = {
+    {"floors", storix::bench::measureFloors, true},    {"requests", storix::bench::measureRequests, true},
+    {"claims", storix::bench::measureClaims, true},    {"store", storix::bench::measureStore, true},
+    {"queues", storix::bench::measureQueues, true},    {"registry", storix::bench::measureRegistry, true},
+    {"start-up", storix::bench::measureStartUp, true}, {"memory", storix::bench::measureMemory, true},
+    {"peers", storix::bench::measurePeers, false},
+};
+
+constexpr std::string_view tableBegin = "<!-- table begins -->\n";
+constexpr std::string_view tableEnd = "<!-- table ends -->\n";
+
+bool putInto(const std::string &page, const std::string &table) {
+  std::ifstream input(page, std::ios::binary);
+  std::string text((std::istreambuf_iterator<char>(input)), std::istreambuf_iterator<char>());
+  const std::size_t begin = text.find(tableBegin);
+  const std::size_t end = text.find(tableEnd);
+  if (begin == std::string::npos || end == std::string::npos || end < begin) return false;
+  const std::size_t start = begin + tableBegin.size();
+  text.replace(start, end - start, table);
+  std::ofstream output(page, std::ios::binary | std::ios::trunc);
+  output << text;
+  return static_cast<bool>(output.flush());
+}
+
+int usage() {
+  (void)std::fputs("usage: storix_bench [--quick] [--only PART]... [--into FILE]\nPARTs:", stderr);
+  for (const Part &part : parts) (void)std::fprintf(stderr, " %s", std::string(part.name).c_str());
+  (void)std::fputs("\n", stderr);
+  return 2;
+}
+
+}  // namespace
+
+int main(int count, char **arguments) {
+  storix::bench::Extent extent;
+  std::vector<std::string_view> only;
+  std::optional<std::string> page;
+  for (int i = 1; i < count; ++i) {
+    const std::string_view argument = arguments[i];
+    if (argument == "--quick") {
+      extent.quick = true;
+    } else if (argument == "--only" && i + 1 < count) {
+      only.emplace_back(arguments[++i]);
+    } else if (argument == "--into" && i + 1 < count) {
+      page = arguments[++i];
+    } else {
+      return usage();
+    }
+  }
+  for (const std::string_view name : only) {
+    if (std::none_of(std::begin(parts), std::end(parts), [name](const Part &part) { return part.name == name; })) {
+      return usage();
+    }
+  }
+  Table table(extent);
+  for (const Part &part : parts) {
+    const bool named = std::find(only.begin(), only.end(), part.name) != only.end();
+    if (named || (only.empty() && (part.inQuickForm || !extent.quick))) part.measure(table);
+  }
+  if (!extent.quick) std::printf("\nBounds that are not met: %zu\n", table.missedBounds());
+  if (page && !putInto(*page, table.markdown())) {
+    (void)std::fprintf(stderr, "storix_bench: %s has no place for the table.\n", page->c_str());
+    return 1;
+  }
+  return 0;
+}
