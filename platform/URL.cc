@@ -43,15 +43,13 @@ std::string percentEncoded(std::string_view path) {
 std::string percentDecoded(std::string_view text) {
   std::string decoded;
   decoded.reserve(text.size());
-  for (std::size_t i = 0; i < text.size(); ++i) {
-    if (text[i] == '%') {
-      decoded += static_cast<char>(hexValue(text[i + 1]) * 16 + hexValue(text[i + 2]));
-      i += 2;
-    } else {
-      decoded += text[i];
-    }
+  while (true) {
+    const std::size_t escape = text.find('%');
+    decoded += text.substr(0, escape);
+    if (escape == std::string_view::npos) return decoded;
+    decoded += static_cast<char>(hexValue(text[escape + 1]) * 16 + hexValue(text[escape + 2]));
+    text.remove_prefix(escape + 3);
   }
-  return decoded;
 }
 
 std::string_view withoutTrailingSlashes(std::string_view text) {

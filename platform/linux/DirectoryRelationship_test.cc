@@ -177,6 +177,63 @@ TEST_F(DirectoryRelationshipTest, ChangedLinkIsSeenAtOnce) {
   EXPECT_EQ(relationshipOf(test_ / "link/a"), other);
 }
 
+TEST_F(DirectoryRelationshipTest, LookupOverManyDirectoriesFindsTheOneThatHoldsTheItem) {
+  test_.makeFile("provider/Storix Storage/sub/a", "");
+  test_.makeLink("link", directory_ + "/sub");
+  const std::string second = test_.makeDirectory("second");
+  const std::string third = test_.makeDirectory("third");
+  for (const std::string &item : {directory_ + "/sub/a", directory_ + "/absent/a", test_ / "link/a",
+                                  test_ / "link/absent", test_ / "third/../link/a"}) {
+    EXPECT_EQ(relationshipTo(second, item), other) << item;
+    EXPECT_EQ(relationshipTo(third, item), other) << item;
+    EXPECT_EQ(relationshipTo(test_ / "link/..", item), contains) << item;
+    EXPECT_EQ(relationshipTo(third, item), other) << item;
+    EXPECT_EQ(relationshipTo(directory_, item), contains) << item;
+    EXPECT_EQ(relationshipTo(third, item), other) << item;
+    EXPECT_EQ(relationshipTo("/", item), contains) << item;
+  }
+}
+
+TEST_F(DirectoryRelationshipTest, LookupFindsTheItemToBeADirectoryItself) {
+  const std::string second = test_.makeDirectory("second");
+  test_.makeLink("link", directory_);
+  EXPECT_EQ(relationshipTo(second, test_ / "link"), other);
+  EXPECT_EQ(relationshipTo(test_ / "provider/../second", test_ / "link"), other);
+  EXPECT_EQ(relationshipTo(directory_, test_ / "link"), same);
+}
+
+TEST_F(DirectoryRelationshipTest, WhatALookupKnowsNeverMakesADirectoryHoldWhatLeftIt) {
+  const std::string second = test_.makeDirectory("second");
+  test_.makeFile("provider/Storix Storage/a", "");
+  test_.makeLink("link", directory_);
+  EXPECT_EQ(relationshipTo(second, test_ / "link/a"), other);
+  std::filesystem::remove(test_ / "link");
+  test_.makeLink("link", test_ / "elsewhere");
+  EXPECT_EQ(relationshipTo(directory_, test_ / "link/a"), other);
+}
+
+TEST_F(DirectoryRelationshipTest, NextLookupSeesWhereTheItemIsNow) {
+  const std::string second = test_.makeDirectory("second");
+  test_.makeLink("link", test_ / "elsewhere");
+  EXPECT_EQ(relationshipTo(second, test_ / "link/a"), other);
+  EXPECT_EQ(relationshipTo(directory_, test_ / "link/a"), other);
+  std::filesystem::remove(test_ / "link");
+  test_.makeLink("link", directory_);
+  EXPECT_EQ(relationshipTo(second, test_ / "link/a"), other);
+  EXPECT_EQ(relationshipTo(directory_, test_ / "link/a"), contains);
+}
+
+TEST_F(DirectoryRelationshipTest, DirectoryThatMovedIsFoundWhereItIs) {
+  const std::string second = test_.makeDirectory("second");
+  const std::string third = test_.makeDirectory("third");
+  test_.makeFile("third/a", "");
+  EXPECT_EQ(relationshipTo(second, test_ / "third/a"), other);
+  EXPECT_EQ(relationshipTo(directory_, test_ / "third/a"), other);
+  std::filesystem::remove(directory_);
+  test_.makeLink("provider/Storix Storage", third);
+  EXPECT_EQ(relationshipTo(directory_, test_ / "third/a"), contains);
+}
+
 TEST(ResolvedPath, RelativePathAndZeroByteAreRefused) {
   EXPECT_FALSE(resolvePath("a/b"));
   EXPECT_FALSE(resolvePath(""));

@@ -1,5 +1,6 @@
 #include "platform/linux/IoLoop.h"
 
+#include <poll.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
 
@@ -24,6 +25,10 @@ constexpr std::size_t maximumThreads = 64;
 /// So many threads wait at most for long; those beyond them end after a while without work.
 constexpr std::size_t keptWaitingThreads = 2;
 constexpr int idleMilliseconds = 10'000;
+/// How long a thread that has served a descriptor waits for that one alone before it waits for all. A
+/// peer that goes on asking is answered by one thread then, and epoll has nothing to do with it.
+constexpr int stayingMilliseconds = 1;
+constexpr std::size_t maximumStayingThreads = 16;
 /// The identifier under which epoll reports the end of the loop.
 constexpr std::uint64_t endIdentifier = 0;
 
@@ -57,6 +62,7 @@ struct IoLoop::Implementation {
   std::list<std::thread> threads;
   std::list<std::thread> finished;
   std::size_t waiting = 0;
+  std::size_t staying = 0;
 
   /// With `entry.mutex` held: makes epoll wait for what the entry wants.
   [[nodiscard]] bool arm(Entry &entry) const {
@@ -101,6 +107,7 @@ struct IoLoop::Implementation {
   class EpollWatch;
   void work(const std::shared_ptr<Implementation> &self, std::list<std::thread>::iterator own);
   void serve(std::uint64_t identifier, std::uint32_t events);
+  [[nodiscard]] std::uint32_t stayWith(Entry &entry);
 };
 
 void IoLoop::Implementation::work(const std::shared_ptr<Implementation> &self, std::list<std::thread>::iterator own) {
@@ -148,10 +155,10 @@ void IoLoop::Implementation::serve(std::uint64_t identifier, std::uint32_t event
     entry->running = true;
     entry->runner = std::this_thread::get_id();
   }
-  {
+  do {
     const ThreadPool::LocalTasks localTasks(pool);
     entry->handler(events);
-  }
+  } while ((events = stayWith(*entry)) != 0);
   Handler unused;
   const std::lock_guard lock(entry->mutex);
   entry->running = false;
@@ -162,6 +169,30 @@ void IoLoop::Implementation::serve(std::uint64_t identifier, std::uint32_t event
     (void)arm(*entry);
   }
   entry->served.notify_all();
+}
+
+/// Waits a little for the entry that this thread has just served, if another thread waits for all
+/// others meanwhile. Gives what the descriptor is ready for; 0 where it is to be armed again.
+std::uint32_t IoLoop::Implementation::stayWith(Entry &entry) {
+  pollfd waited{entry.fd, 0, 0};
+  {
+    const std::lock_guard lock(entry.mutex);
+    if (entry.destroyed || entry.events == 0) return 0;
+    waited.events = static_cast<short>(entry.events);
+  }
+  {
+    const std::lock_guard lock(mutex);
+    if (ended || waiting == 0 || staying == maximumStayingThreads) return 0;
+    ++staying;
+  }
+  const bool isReady = ::poll(&waited, 1, stayingMilliseconds) > 0;
+  {
+    const std::lock_guard lock(mutex);
+    --staying;
+  }
+  if (!isReady) return 0;
+  const std::lock_guard lock(entry.mutex);
+  return entry.destroyed || entry.events == 0 ? 0 : static_cast<std::uint32_t>(waited.revents);
 }
 
 class IoLoop::Implementation::EpollWatch : public IoLoop::Watch {

@@ -11,7 +11,8 @@ namespace storix::linuxhost {
 /// Waits for file descriptors and calls back when they are ready, on a few threads of its own that
 /// share the work: whichever thread waits takes the next ready descriptor and serves it to the end,
 /// while another one waits in its place. So a request costs no change of thread, and a slow one
-/// delays nobody else: when every thread is busy, one more is started, up to a limit.
+/// delays nobody else: when every thread is busy, one more is started, up to a limit. Having served a
+/// descriptor, a thread waits a millisecond for that one alone: who goes on asking is served faster.
 ///
 ///  1. The handler of one watch never runs on two threads at once.
 ///  2. After a watch is destroyed its handler does not start again; the destructor waits for one that
