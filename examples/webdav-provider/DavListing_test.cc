@@ -30,6 +30,7 @@ std::vector<DavEntry> read(const std::string &responses, const std::string &path
 
 std::vector<std::string> paths(const std::vector<DavEntry> &entries) {
   std::vector<std::string> all;
+  all.reserve(entries.size());
   for (const DavEntry &entry : entries) all.push_back(entry.path);
   return all;
 }

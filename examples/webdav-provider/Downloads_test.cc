@@ -13,7 +13,6 @@ namespace storix::example {
 namespace {
 
 namespace fs = std::filesystem;
-using ::testing::ElementsAre;
 using ::testing::HasSubstr;
 using ::testing::Not;
 using ::testing::SizeIs;
@@ -90,7 +89,7 @@ TEST_F(Downloads, ABrokenDownloadGoesOnWhereItBroke) {
   EXPECT_EQ(local("film"), longContent());
   const auto gets = proxy_.requests("GET");
   ASSERT_THAT(gets, SizeIs(3));
-  for (const std::size_t i : {1, 2}) {
+  for (const std::size_t i : {1U, 2U}) {
     EXPECT_THAT(gets[i], HasSubstr("Range: bytes="));
     EXPECT_THAT(gets[i], HasSubstr("If-Range: \""));
   }
