@@ -302,8 +302,9 @@ TEST_F(ConfinedExtensionTest, TerminationSignalReachesTheProgramItself) {
   ASSERT_TRUE(time_.waitForTaskIn(5s));
   time_.advance(5s);
   EXPECT_TRUE(process.waitForExit());
-  // Its output is read to the end when it is reaped.
-  host_.reset();
+  // Its output is read to the end after it was reaped.
+  const auto deadline = std::chrono::steady_clock::now() + 60s;
+  while (linesWith("cleaned up").empty() && std::chrono::steady_clock::now() < deadline) std::this_thread::yield();
   EXPECT_THAT(linesWith("cleaned up"), ElementsAre("[NOTICE] Extension org.cleans-up: cleaned up"));
 }
 
