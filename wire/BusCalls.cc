@@ -143,7 +143,7 @@ void BusConnection::sendCall(const InterfaceDescription &interface, std::size_t 
     }
     failed = refused ? outgoing.waiter->failed(std::move(*refused)) : state_->transmit(outgoing);
     outgoing.message.reset();
-    if (!state_->ended && state_->hasUnwritten()) wantedChanged = state_->wantedChangedHandler;
+    if (!state_->ended && state_->unwritten() > 0) wantedChanged = state_->wantedChangedHandler;
   }
   if (wantedChanged) wantedChanged();
   state_->runLater(std::move(failed));

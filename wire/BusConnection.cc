@@ -28,6 +28,11 @@ void logEnd(const std::string &peer, const SXError &reason) {
   sx_default_log().notice("[NOTICE] Ended the connection of %@: %@", peer, reason);
 }
 
+bool isWritable(int fd) {
+  pollfd waited{fd, POLLOUT, 0};
+  return poll(&waited, 1, 0) > 0 && (waited.revents & POLLOUT) != 0;
+}
+
 bool hasHungUp(int fd) {
   pollfd waited{fd, 0, 0};
   return poll(&waited, 1, 0) > 0;
@@ -134,8 +139,9 @@ bool BusConnection::step(Lock &lock) {
     dispatch(lock, std::move(message));
     return true;
   }
-  const bool writes = state.hasUnwritten();
-  if (state.isFull() && (!writes || state.held.size() >= maximumHeldRequests)) {
+  const bool writes = state.unwritten() > 0;
+  // sd-bus reads where it has nothing to write, or cannot.
+  if (state.isFull() && !(writes && isWritable(fd_))) {
     if (hasHungUp(fd_)) end(lock, posixError(ECONNRESET, "the peer closed the connection"), false);
     return false;
   }

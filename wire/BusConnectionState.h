@@ -20,9 +20,6 @@
 
 namespace storix::wire {
 
-/// Requests that sd-bus may read beyond those in flight, beside the writing that was asked of it.
-inline constexpr std::size_t maximumHeldRequests = 16;
-
 inline std::string_view textOrEmpty(const char *text) { return text ? std::string_view(text) : std::string_view(); }
 
 /// Waits for the answer to one message. One of the two functions is called, once; the task that it
@@ -99,13 +96,17 @@ struct BusConnection::State {
 
   // Requests of the peer.
   std::size_t requestsInFlight = 0;
+  /// Those that sd-bus has read beside the writing that was asked of it: one at most whenever the socket
+  /// takes a part of a message.
   std::deque<OwnedMessage> held;
 
-  [[nodiscard]] bool isFull() const { return requestsInFlight >= options.requestsInFlightAtMost; }
+  /// An answer that has not been written is in flight too, so that a peer that reads none cannot have them
+  /// made for ever.
+  [[nodiscard]] bool isFull() const { return requestsInFlight + unwritten() >= options.requestsInFlightAtMost; }
 
-  [[nodiscard]] bool hasUnwritten() const {
+  [[nodiscard]] std::size_t unwritten() const {
     std::uint64_t count = 0;
-    return sd_bus_get_n_queued_write(bus.get(), &count) >= 0 && count > 0;
+    return sd_bus_get_n_queued_write(bus.get(), &count) >= 0 ? static_cast<std::size_t>(count) : 0;
   }
 
   void runLater(Task task) const {

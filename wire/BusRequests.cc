@@ -76,7 +76,7 @@ void BusConnection::Request::finish(const Append &append) {
       }
     }
     message.reset();
-    if (!state.ended && (wasFull || state.hasUnwritten())) wantedChanged = state.wantedChangedHandler;
+    if (!state.ended && (wasFull || state.unwritten() > 0)) wantedChanged = state.wantedChangedHandler;
   }
   if (wantedChanged) wantedChanged();
 }

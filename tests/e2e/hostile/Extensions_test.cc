@@ -1,0 +1,163 @@
+// Attacks by an extension: answers that are none, too large, too many or never; processes that leave others
+// behind.
+
+#include "tests/e2e/hostile/HostileTest.h"
+
+namespace storix::e2e {
+namespace {
+
+constexpr const char *hostile = "org.sample.hostile";
+
+struct Misdeed {
+  const char *name;
+  const char *script;
+  /// In the log, or nothing.
+  const char *line;
+  /// Whether the request fails.
+  bool fails = true;
+};
+
+void PrintTo(const Misdeed &misdeed, std::ostream *out) { *out << misdeed.name; }
+
+class HostileExtensions : public HostileTest {
+ protected:
+  void installHostile(const std::string &script) {
+    const std::filesystem::path staged = session.directory() / "hostile.staged";
+    std::filesystem::create_directory(staged);
+    session.write(staged / "script", script);
+    std::filesystem::copy_file(builtProgram("e2e_hostile_provider"), staged / "provider");
+    session.write(staged / "Info.kvs", R"({"KTBundleIdentifier": "org.sample.hostile", "KTBundleExecutable": "provider",
+        "KTBundleVersion": "1", "KTGroupContainers": ["group.org.sample.hostile"],
+        "KTExtensionPointIdentifier": "com.tessel.storix-nonui",
+        "KTExtension": {"KTExtensionStorixDocumentGroup": "group.org.sample.hostile"}})");
+    std::filesystem::rename(staged, session.extensionsDirectory() / "hostile.appdex");
+    std::filesystem::create_directories(session.storage(hostile));
+  }
+
+  /// What it takes when the hostile provider's process runs as well.
+  void startWithBoth(const std::string &script) {
+    installHostile(script);
+    startWithBystander();
+    ASSERT_TRUE(daemon->waitForLine("Registered storix provider extension org.sample.hostile"));
+    const auto granted = bystander->extendSandbox(itemURL(hostile, "item"), hostile, "c");
+    ASSERT_TRUE(granted) << granted.error().message();
+    descriptors = descriptorsInUse();
+    memory = memoryInUse();
+  }
+
+  [[nodiscard]] Message startRequest() const {
+    return Message::service("StartProvidingItemAtURL", "asasas",
+                            itemArguments(itemURL(hostile, "item").absoluteString(), hostile, "c"));
+  }
+};
+
+class Misdeeds : public HostileExtensions, public testing::WithParamInterface<Misdeed> {};
+
+TEST_P(Misdeeds, FailTheirOwnRequestAloneAndOthersAreServedMeanwhile) {
+  startWithBoth(GetParam().script);
+  {
+    RawClient waiting = serviceClient();
+    ASSERT_TRUE(waiting.send(startRequest()));
+    // Many requests of others are answered before anybody looks what became of that one.
+    for (int i = 0; i < 20; ++i) ASSERT_NO_FATAL_FAILURE(serveBystander());
+    ASSERT_NO_FATAL_FAILURE(grantAndStart(*bystander, docs, "letter"));
+    const std::optional<RawAnswer> answer = waiting.readAnswerTo(1);
+    ASSERT_TRUE(answer) << "the client has lost its connection";
+    EXPECT_EQ("", answer->errorName);
+    EXPECT_EQ(GetParam().fails, answer->body.find("com.tessel.storix") != std::string::npos)
+        << testing::PrintToString(answer->body) << testing::PrintToString(daemon->errorLines());
+    if (*GetParam().line) {
+      EXPECT_TRUE(daemon->waitForLine(GetParam().line));
+    }
+  }
+  expectHealthy();
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Hostile, Misdeeds,
+    testing::Values(
+        Misdeed{"AnswerOfAnotherSignature", "signature", "Refused the reply to \"StartProvidingItemAtURL\""},
+        Misdeed{"TwoErrorsWhereOneMayStand", "two-errors", "may have one value at most"},
+        Misdeed{"DBusErrorAsAnswer", "bus-error", "was not answered: text"},
+        Misdeed{"AnswerOfAHundredMegabytes", "megabytes", "a message is larger than 1048576 bytes"},
+        Misdeed{"HalfAnAnswerAndAnExit", "half", "exited with status 0"},
+        Misdeed{"ExitInsteadOfAnAnswer", "exit", "exited with status 3"},
+        Misdeed{"CrashInsteadOfAnAnswer", "crash", "was killed by signal 9"},
+        Misdeed{"ChildrenLeftBehind", "fork", "exited with status 0"},
+        Misdeed{"JunkInsteadOfAnAnswer", "junk", "Ended the connection of extension org.sample.hostile"},
+        Misdeed{"ValuesNestedTooDeep", "deep", "values are nested more than 16 deep"},
+        Misdeed{"KeyThatStandsTwice", "key-twice", "a dictionary has a key twice"},
+        Misdeed{"URLThatIsNoneInsideAnError", "bad-url", "Refused the reply to \"StartProvidingItemAtURL\""},
+        Misdeed{"DescriptorsWithTheAnswer", "descriptors", "Ended the connection of extension org.sample.hostile"},
+        Misdeed{"ErrorOfThirtyThousandDetails", "wide", "org.sample.wide"},
+        Misdeed{"AnswerThatComesThreeTimes", "twice", "", false},
+        Misdeed{"SignalsAndAnswersToNothing", "strays", "", false},
+        Misdeed{"FloodOfOutput", "output", "line of a flood", false},
+        Misdeed{"FloodOfCallsWhoseAnswersNobodyReads", "calls", "", false}),
+    [](const auto &misdeed) { return std::string(misdeed.param.name); });
+
+TEST_F(HostileExtensions, ExtensionThatNeverAnswersKeepsNobodyElseWaiting) {
+  startWithBoth("never");
+  {
+    const RawClient waiting = serviceClient();
+    for (std::uint32_t serial = 1; serial <= 100; ++serial) {
+      ASSERT_TRUE(waiting.send(startRequest().numbered(serial)));
+    }
+    for (int i = 0; i < 100; ++i) ASSERT_NO_FATAL_FAILURE(serveBystander());
+    ASSERT_NO_FATAL_FAILURE(grantAndStart(*bystander, docs, "letter"));
+  }
+  expectHealthy();
+}
+
+TEST_F(HostileExtensions, ExtensionThatClosesItsConnectionAndStaysFailsItsRequestAlone) {
+  startWithBoth("close");
+  {
+    RawClient waiting = serviceClient();
+    ASSERT_TRUE(waiting.send(startRequest()));
+    ASSERT_NO_FATAL_FAILURE(grantAndStart(*bystander, docs, "letter"));
+    const std::optional<RawAnswer> answer = waiting.readAnswerTo(1);
+    ASSERT_TRUE(answer);
+    EXPECT_NE(std::string::npos, answer->body.find("com.tessel.storix"));
+  }
+  expectHealthy();
+}
+
+TEST_F(HostileExtensions, ExtensionThatExitsAtOnceIsGivenARestAndOthersAreServed) {
+  session.installBundle("exits", R"({"KTBundleIdentifier": "org.sample.exits", "KTBundleExecutable": "provider",
+      "KTBundleVersion": "1", "KTGroupContainers": ["group.x"], "KTExtensionPointIdentifier": "com.tessel.storix-nonui",
+      "KTExtension": {"KTExtensionStorixDocumentGroup": "group.x"}})",
+                        "/bin/false");
+  startWithBystander();
+  ASSERT_TRUE(daemon->waitForLine("Could not register storix provider org.sample.exits"));
+  const std::size_t started = daemon->countLines("of the extension org.sample.exits.");
+  EXPECT_LE(started, 3U);
+  for (int i = 0; i < 20; ++i) {
+    EXPECT_FALSE(bystander->extendSandbox(*URL::fileURLWithPath("/x"), "org.sample.exits", "c"));
+  }
+  // Each request would start it once more, if it were not resting.
+  EXPECT_LE(daemon->countLines("Started process"), 8U);
+  expectHealthy();
+}
+
+TEST_F(HostileExtensions, URLThatAnExtensionNamesOutsideItsContainerGetsNoToken) {
+  startWithBoth("never");
+  // The extension says that its item lies at /etc/passwd.
+  session.beApplication("org.sample.files", R"({"com.tessel.storix.acl-write": true})");
+  ASSERT_TRUE(bystander->extendSandbox(itemURL(hostile, "item"), hostile, "org.sample.files"));
+  const auto resolved = bystander->resolveBookmark("storix:org.sample.hostile/item");
+  EXPECT_TRUE(!resolved || !resolved.value().token);
+  expectHealthy();
+}
+
+TEST_F(HostileExtensions, BundleThatBecomesALinkIsNotServed) {
+  startWithBystander();
+  std::filesystem::create_directory(session.directory() / "loop");
+  std::filesystem::create_directory_symlink("loop.appdex", session.extensionsDirectory() / "loop.appdex");
+  std::filesystem::create_directory_symlink("/proc/self/fd", session.extensionsDirectory() / "proc.appdex");
+  ASSERT_NO_FATAL_FAILURE(serveBystander());
+  EXPECT_FALSE(bystander->extendSandbox(*URL::fileURLWithPath("/x"), "loop", "c"));
+  expectHealthy();
+}
+
+}  // namespace
+}  // namespace storix::e2e
