@@ -3,8 +3,12 @@
 //   --only   floors, requests, claims, store, queues, registry, start-up, memory or peers
 //   --into   puts the table into a page, between the lines that mark its place
 
+#include <sys/utsname.h>
+
 #include <algorithm>
+#include <array>
 #include <cstdio>
+#include <ctime>
 #include <fstream>
 #include <iterator>
 #include <optional>
@@ -34,6 +38,28 @@ constexpr Part parts[] = {
 
 constexpr std::string_view tableBegin = "<!-- table begins -->\n";
 constexpr std::string_view tableEnd = "<!-- table ends -->\n";
+
+/// The value of the first line of a file under /proc that begins with the key.
+std::string valueOf(const char *file, std::string_view key) {
+  std::ifstream input(file);
+  for (std::string line; std::getline(input, line);) {
+    if (!line.starts_with(key)) continue;
+    const std::size_t value = line.find_first_not_of(" \t", line.find(':') + 1);
+    return value == std::string::npos ? std::string() : line.substr(value);
+  }
+  return "unknown";
+}
+
+std::string machine() {
+  utsname system{};
+  (void)::uname(&system);
+  const std::time_t now = std::time(nullptr);
+  std::array<char, 32> day{};
+  (void)std::strftime(day.data(), day.size(), "%Y-%m-%d", std::gmtime(&now));
+  return "\nMeasured on " + std::string(day.data()) + ": " + std::to_string(storix::bench::processorCount()) +
+         " processors (" + valueOf("/proc/cpuinfo", "model name") + "), " + valueOf("/proc/meminfo", "MemTotal") +
+         " of memory, Linux " + system.release + ", compiler " + __VERSION__ + ", build \"release\".\n";
+}
 
 bool putInto(const std::string &page, const std::string &table) {
   std::ifstream input(page, std::ios::binary);
@@ -84,7 +110,7 @@ int main(int count, char **arguments) {
     if (named || (only.empty() && (part.inQuickForm || !extent.quick))) part.measure(table);
   }
   if (!extent.quick) std::printf("\nBounds that are not met: %zu\n", table.missedBounds());
-  if (page && !putInto(*page, table.markdown())) {
+  if (page && !putInto(*page, machine() + table.markdown())) {
     (void)std::fprintf(stderr, "storix_bench: %s has no place for the table.\n", page->c_str());
     return 1;
   }
