@@ -91,7 +91,6 @@ INSTANTIATE_TEST_SUITE_P(
         Attack{"Signal", alone([](Message &made) { made.type = 4; })},
         Attack{"UnknownMessageType", alone([](Message &made) { made.type = 99; })},
         Attack{"MessageTypeZero", alone([](Message &made) { made.type = 0; })},
-        Attack{"UnknownProtocolVersion", alone([](Message &made) { made.version = 2; })},
         Attack{"SerialZero", alone([](Message &made) { made.serial = 0; })},
         Attack{"CallWithoutMember", alone([](Message &made) { made.fields.pop_back(); })},
         Attack{"PathThatIsNone", alone([](Message &made) { made.fields[0].second.second = "no//path/"; })},
