@@ -4,6 +4,7 @@
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
 
+#include <atomic>
 #include <cerrno>
 #include <condition_variable>
 #include <csignal>
@@ -26,9 +27,10 @@ constexpr std::size_t maximumThreads = 64;
 constexpr std::size_t keptWaitingThreads = 2;
 constexpr int idleMilliseconds = 10'000;
 /// How long a thread that has served a descriptor waits for that one alone before it waits for all. A
-/// peer that goes on asking is answered by one thread then, and epoll has nothing to do with it.
+/// peer that goes on asking is answered by one thread then, and epoll has nothing to do with it. Of many
+/// peers few are served so: threads that wait for all find the next one without going to sleep.
 constexpr int stayingMilliseconds = 1;
-constexpr std::size_t maximumStayingThreads = 16;
+constexpr std::size_t maximumStayingThreads = 2;
 /// The identifier under which epoll reports the end of the loop.
 constexpr std::uint64_t endIdentifier = 0;
 
@@ -56,7 +58,7 @@ struct IoLoop::Implementation {
   UniqueFd endEvent;
 
   std::mutex mutex;
-  bool ended = false;
+  std::atomic<bool> ended = false;  // written under the mutex
   std::uint64_t nextIdentifier = endIdentifier + 1;
   std::unordered_map<std::uint64_t, std::shared_ptr<Entry>> entries;
   std::list<std::thread> threads;
@@ -107,7 +109,7 @@ struct IoLoop::Implementation {
   class EpollWatch;
   void work(const std::shared_ptr<Implementation> &self, std::list<std::thread>::iterator own);
   void serve(std::uint64_t identifier, std::uint32_t events);
-  [[nodiscard]] std::uint32_t stayWith(Entry &entry);
+  [[nodiscard]] std::uint32_t stayWith(Entry &entry, bool &stays);
 };
 
 void IoLoop::Implementation::work(const std::shared_ptr<Implementation> &self, std::list<std::thread>::iterator own) {
@@ -155,10 +157,15 @@ void IoLoop::Implementation::serve(std::uint64_t identifier, std::uint32_t event
     entry->running = true;
     entry->runner = std::this_thread::get_id();
   }
+  bool stays = false;
   do {
     const ThreadPool::LocalTasks localTasks(pool);
     entry->handler(events);
-  } while ((events = stayWith(*entry)) != 0);
+  } while ((events = stayWith(*entry, stays)) != 0);
+  if (stays) {
+    const std::lock_guard lock(mutex);
+    --staying;
+  }
   Handler unused;
   const std::lock_guard lock(entry->mutex);
   entry->running = false;
@@ -172,25 +179,23 @@ void IoLoop::Implementation::serve(std::uint64_t identifier, std::uint32_t event
 }
 
 /// Waits a little for the entry that this thread has just served, if another thread waits for all
-/// others meanwhile. Gives what the descriptor is ready for; 0 where it is to be armed again.
-std::uint32_t IoLoop::Implementation::stayWith(Entry &entry) {
+/// others meanwhile; `stays` says that it has been counted. Gives what the descriptor is ready for; 0 where it is to be
+/// armed again.
+std::uint32_t IoLoop::Implementation::stayWith(Entry &entry, bool &stays) {
   pollfd waited{entry.fd, 0, 0};
   {
     const std::lock_guard lock(entry.mutex);
     if (entry.destroyed || entry.events == 0) return 0;
     waited.events = static_cast<short>(entry.events);
   }
-  {
+  if (ended) return 0;
+  if (!stays) {
     const std::lock_guard lock(mutex);
-    if (ended || waiting == 0 || staying == maximumStayingThreads) return 0;
+    if (waiting == 0 || staying == maximumStayingThreads) return 0;
     ++staying;
+    stays = true;
   }
-  const bool isReady = ::poll(&waited, 1, stayingMilliseconds) > 0;
-  {
-    const std::lock_guard lock(mutex);
-    --staying;
-  }
-  if (!isReady) return 0;
+  if (::poll(&waited, 1, stayingMilliseconds) <= 0) return 0;
   const std::lock_guard lock(entry.mutex);
   return entry.destroyed || entry.events == 0 ? 0 : static_cast<std::uint32_t>(waited.revents);
 }
