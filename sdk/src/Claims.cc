@@ -36,8 +36,11 @@ void Claims::begin(Claim::Kind kind, const URL &file, ClaimOptions options, Begi
         if (options.deadline) deadline = options.deadline->time();
         const auto pending = std::make_shared<Pending<Result<FileClaim>>>(self->thread_->loop(), deadline, handler);
         pending->start(options.cancellation);
-        if (pending->isFinished()) return;
-        self->ask(std::make_shared<Claim>(self, kind), file, options.identifier, pending);
+        const auto ask = [self, kind, file, identifier = options.identifier, pending] {
+          if (!pending->isFinished()) self->ask(std::make_shared<Claim>(self, kind), file, identifier, pending);
+        };
+        if (self->start_ && !pending->isFinished()) return self->start_->then(ask);
+        ask();
       });
 }
 
@@ -85,7 +88,9 @@ Result<Claims::ConnectionPointer> Claims::connect() {
                   bus.setClosedHandler([weak, added](const SXError &) {
                     const auto self = weak.lock();
                     const auto closed = added.lock();
-                    if (self && closed) self->drop(closed);
+                    if (!self || !closed) return;
+                    if (self->start_) self->start_->forget();
+                    self->drop(closed);
                   });
                 });
   if (!opened) return opened.error();

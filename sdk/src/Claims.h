@@ -11,6 +11,7 @@
 
 #include "platform/Result.h"
 #include "platform/URL.h"
+#include "sdk/src/DaemonStart.h"
 #include "sdk/src/Pending.h"
 #include "sdk/src/RequestThread.h"
 #include "storix/ClientOptions.h"
@@ -63,8 +64,9 @@ class Claims : public std::enable_shared_from_this<Claims> {
   using BeginHandler = std::function<void(Result<FileClaim>)>;
   using EndHandler = std::function<void(std::optional<SXError>)>;
 
-  Claims(std::shared_ptr<RequestThread> thread, ClientOptions options)
-      : thread_(std::move(thread)), options_(std::move(options)) {}
+  /// With a `start` nothing is asked of a daemon that has not found its providers yet.
+  Claims(std::shared_ptr<RequestThread> thread, ClientOptions options, std::shared_ptr<DaemonStart> start = nullptr)
+      : thread_(std::move(thread)), options_(std::move(options)), start_(std::move(start)) {}
 
   void begin(Claim::Kind kind, const URL &file, ClaimOptions options, BeginHandler handler);
 
@@ -90,6 +92,7 @@ class Claims : public std::enable_shared_from_this<Claims> {
 
   const std::shared_ptr<RequestThread> thread_;
   const ClientOptions options_;
+  const std::shared_ptr<DaemonStart> start_;
   std::vector<ConnectionPointer> connections_;
 };
 

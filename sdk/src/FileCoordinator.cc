@@ -13,7 +13,9 @@ using sdk::Claim;
 class FileCoordinator::Implementation {
  public:
   explicit Implementation(ClientOptions options)
-      : thread(sdk::RequestThread::start()), claims(std::make_shared<sdk::Claims>(thread, std::move(options))) {}
+      : thread(sdk::RequestThread::start()),
+        start(std::make_shared<sdk::DaemonStart>(thread->loop(), options.runtimeDirectory)),
+        claims(std::make_shared<sdk::Claims>(thread, std::move(options), start)) {}
 
   Result<FileClaim> wait(Claim::Kind kind, const URL &file, ClaimOptions options) const {
     return thread->wait<Result<FileClaim>>(
@@ -21,6 +23,7 @@ class FileCoordinator::Implementation {
   }
 
   const std::shared_ptr<sdk::RequestThread> thread;
+  const std::shared_ptr<sdk::DaemonStart> start;
   const std::shared_ptr<sdk::Claims> claims;
 };
 

@@ -5,6 +5,7 @@
 
 #include <cerrno>
 #include <condition_variable>
+#include <cstdlib>
 #include <filesystem>
 #include <future>
 #include <map>
@@ -32,6 +33,7 @@ using Outcome = std::optional<SXError>;
 class FileCoordinatorTest : public ::testing::Test {
  protected:
   FileCoordinatorTest() {
+    daemon_.daemon->onWakeUp = [](const CompletionHandler<> &reply) { reply(); };
     daemon_.onBeginRead = beginning("read");
     daemon_.onBeginWrite = beginning("write");
     daemon_.onEndRead = ending("end of read");
@@ -130,6 +132,62 @@ TEST_F(FileCoordinatorTest, AReadIsAskedForAndEnded) {
   EXPECT_FALSE(claim.value().isHeld());
   EXPECT_FALSE(claim.value().lost());
   EXPECT_THAT(events(), ElementsAre("read file:///storage/a%20b org.sample.reader", "end of read 1"));
+}
+
+TEST_F(FileCoordinatorTest, NothingIsAskedOfADaemonThatHasNotFoundItsProviders) {
+  std::vector<CompletionHandler<>> woken;
+  daemon_.daemon->onWakeUp = [&](const CompletionHandler<> &reply) {
+    change([&] {
+      events_.emplace_back("wake");
+      woken.push_back(reply);
+    });
+  };
+  giveAtOnce();
+  FileCoordinator coordinator(options());
+  std::promise<bool> given;
+  coordinator.read(file_, {}, [&given](const Result<FileClaim> &claim) { given.set_value(claim.ok()); });
+  EXPECT_EQ(coordinator.read(file_, {.deadline = milliseconds(1)}).error().code(),
+            static_cast<std::int64_t>(ClientErrorCode::timedOut));
+  waitForEvents(1);
+  change([this] { events_.emplace_back("found"); });
+  woken.at(0)();
+  EXPECT_TRUE(given.get_future().get());
+  EXPECT_TRUE(coordinator.read(file_).ok());
+  const std::vector<std::string> seen = events();
+  EXPECT_THAT((std::vector(seen.begin(), seen.begin() + 3)),
+              ElementsAre("wake", "found", "read file:///storage/a%20b nobody"));
+  EXPECT_EQ(woken.size(), 1U);
+}
+
+TEST_F(FileCoordinatorTest, TheNextDaemonIsWaitedForAgain) {
+  daemon_.daemon->onWakeUp = [this](const CompletionHandler<> &reply) {
+    change([this] { events_.emplace_back("wake"); });
+    reply();
+  };
+  giveAtOnce();
+  FileCoordinator coordinator(options());
+  auto claim = coordinator.read(file_);
+  ASSERT_TRUE(claim.ok());
+  daemon_.closeConnections();
+  EXPECT_TRUE(claim.value().end().has_value());
+  EXPECT_TRUE(coordinator.read(file_).ok());
+  EXPECT_THAT(events(), testing::Contains("wake").Times(2));
+}
+
+TEST_F(FileCoordinatorTest, AnExtensionDoesNotWaitForTheDaemonThatWaitsForIt) {
+  daemon_.daemon->onWakeUp = nullptr;
+  giveAtOnce();
+  ASSERT_EQ(::setenv("STORIX_EXTENSION_FD", "3", 1), 0);
+  FileCoordinator coordinator(options());
+  ::unsetenv("STORIX_EXTENSION_FD");
+  EXPECT_TRUE(coordinator.read(file_).ok());
+}
+
+TEST_F(FileCoordinatorTest, ADaemonThatCannotBeAskedIsNotWaitedFor) {
+  std::filesystem::remove(daemon_.directory() + "/com.tessel.Storix");
+  giveAtOnce();
+  FileCoordinator coordinator(options());
+  EXPECT_TRUE(coordinator.read(file_).ok());
 }
 
 TEST_F(FileCoordinatorTest, AWriteIsAskedForAndEnded) {

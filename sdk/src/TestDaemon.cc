@@ -100,7 +100,8 @@ int TestDaemon::listenOn(const std::string &name) {
   if (path.size() >= sizeof address.sun_path) std::abort();
   std::memcpy(address.sun_path, path.data(), path.size());
   const int socket = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
-  if (::bind(socket, reinterpret_cast<const sockaddr *>(&address), sizeof address) != 0 || ::listen(socket, SOMAXCONN) != 0) {
+  if (::bind(socket, reinterpret_cast<const sockaddr *>(&address), sizeof address) != 0 ||
+      ::listen(socket, SOMAXCONN) != 0) {
     std::abort();
   }
   return socket;

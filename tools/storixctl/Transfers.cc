@@ -60,7 +60,6 @@ class Transfer {
     }
     const auto url = documentURL(invocation_.operands[0], surroundings_.currentDirectory);
     if (!url) return url.error();
-    if (auto failed = wake()) return *std::move(failed);
     const auto claim = claimForReading(url.value());
     if (!claim) return claim.error();
     const auto opened = openPath(url.value().path());
@@ -96,7 +95,6 @@ class Transfer {
     const auto size = takeIn(replacement.value().descriptor());
     if (!size) return size.error();
 
-    if (auto failed = wake()) return *std::move(failed);
     auto claim = claimForWriting(url.value());
     if (!claim) return claim.error();
     if (!claim.value().isHeld()) return claimLost("nothing was written");
@@ -131,15 +129,6 @@ class Transfer {
   template <class T>
   Result<T> answer(const std::function<void(std::function<void(Result<T>)>)> &start) {
     return await<T>(surroundings_.waiting, start, [this] { line_.show("waiting", std::nullopt, std::nullopt); });
-  }
-
-  /// A daemon that has just been started gives claims before it knows its providers, but answers this
-  /// only when it does.
-  std::optional<SXError> wake() {
-    const auto woken = answer<bool>([this](const std::function<void(Result<bool>)> &handler) {
-      client_.wakeUp([handler](const Client::Outcome &error) { handler(resultOf(error)); });
-    });
-    return woken ? std::nullopt : std::optional(woken.error());
   }
 
   Result<GrantedDocument> resolve() {

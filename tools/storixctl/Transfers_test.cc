@@ -154,21 +154,6 @@ TEST_F(TransfersTest, ReadClaimsTheDocumentAndPrintsIt) {
   EXPECT_THAT(complaint(), IsEmpty());
 }
 
-TEST_F(TransfersTest, AClaimIsAskedForOnceTheDaemonKnowsItsProviders) {
-  scripted()->onWakeUp = [this](const CompletionHandler<> &reply) {
-    note("awake");
-    reply();
-  };
-  directory_.write("a", "old");
-  EXPECT_EQ(contentOf({"read", "a"}), "old");
-  EXPECT_EQ(writeFrom("new", {"write", "a"}), done);
-  const auto seen = events();
-  EXPECT_EQ(seen.at(0), "awake");
-  EXPECT_EQ(seen.at(1), "read " + urlOf("a"));
-  EXPECT_EQ(seen.at(seen.size() - 3), "awake");
-  EXPECT_EQ(seen.at(seen.size() - 2), "write " + urlOf("a"));
-}
-
 TEST_F(TransfersTest, CatResolvesClaimsAndOpensWithTheToken) {
   daemon_->onBeginRead = [this](const MethodValues &values, const Reply &reply) {
     note("read " + std::get<std::string>(values.at(0)));

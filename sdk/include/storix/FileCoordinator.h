@@ -25,6 +25,10 @@ namespace storix {
 /// error EDEADLK. When the coordinator is destroyed, requests without an answer get `connectionLost`
 /// before that returns (or, where a handler destroys it, soon after), and its claims are lost.
 ///
+/// A daemon that has just been started knows no providers yet, and would take their files for
+/// anybody's; so the first claim waits until the daemon answers requests, which is when it has found
+/// them. In an extension's own process nothing waits for that.
+///
 /// A process that waits for a claim that conflicts with one of its own waits for itself: give a
 /// deadline. Errors: what the provider answered to a read; `cancelled`; `timedOut`; `notReachable`;
 /// `connectionLost`; `tooManyClaims`; and `refused` with the name
