@@ -7,6 +7,7 @@
 #include <thread>
 #include <vector>
 
+#include "ProviderCalls.h"
 #include "TemporaryFolder.h"
 
 namespace storix::example {
@@ -15,7 +16,7 @@ namespace {
 namespace fs = std::filesystem;
 using ::testing::HasSubstr;
 
-class FolderProviderTest : public ::testing::Test {
+class FolderProviderTest : public ProviderCalls {
  protected:
   void SetUp() override {
     for (const char *name : {"source", "docs.appdex", "group", "group/Storix Storage"}) {
@@ -34,32 +35,13 @@ class FolderProviderTest : public ::testing::Test {
     return *provider_;
   }
 
-  URL item(const std::string &path) { return *URL::fileURLWithPath(folder_.path("group/Storix Storage/" + path)); }
+  ProviderExtension &extension() override { return provider(); }
+  [[nodiscard]] URL item(const std::string &path) const override {
+    return *URL::fileURLWithPath(folder_.path("group/Storix Storage/" + path));
+  }
   std::string copy(const std::string &path) { return folder_.read("group/Storix Storage/" + path); }
   bool isProvided(const std::string &path) { return fs::exists(folder_.path("group/Storix Storage/" + path)); }
 
-  template <class Outcome = std::optional<SXError>, class Call>
-  static Outcome answer(const Call &call) {
-    std::optional<Outcome> given;
-    call([&given](Outcome outcome) { given.emplace(std::move(outcome)); });
-    EXPECT_TRUE(given.has_value());
-    return *std::move(given);
-  }
-  std::optional<SXError> setUp() {
-    return answer([&](auto done) { provider().performInitialSetup(done); });
-  }
-  std::optional<SXError> start(const std::string &path) {
-    return answer([&](auto done) { provider().startProviding(item(path), done); });
-  }
-  std::optional<SXError> stop(const std::string &path) {
-    return answer([&](auto done) { provider().stopProviding(item(path), done); });
-  }
-  std::optional<SXError> changed(const std::string &path) {
-    return answer([&](auto done) { provider().itemChanged(item(path), done); });
-  }
-  Result<URL> placeholder(const std::string &path) {
-    return answer<Result<URL>>([&](auto done) { provider().providePlaceholder(item(path), done); });
-  }
   Result<std::string> identifier(const URL &url) {
     return answer<Result<std::string>>([&](auto done) { provider().itemIdentifier(url, done); });
   }

@@ -9,6 +9,7 @@
 #include <string>
 #include <utility>
 
+#include "examples/folder-provider/ProviderCalls.h"
 #include "examples/webdav-provider/Configuration.h"
 #include "examples/webdav-provider/FaultProxy.h"
 #include "examples/webdav-provider/TestDavServer.h"
@@ -17,7 +18,7 @@
 namespace storix::example {
 
 /// A provider of a real server, with a proxy between them that lets things go wrong.
-class WebDavProviderTest : public ::testing::Test {
+class WebDavProviderTest : public ProviderCalls {
  protected:
   WebDavProviderTest() : proxy_(server_.port()) {
     std::filesystem::create_directories(folder_.path("group/Storix Storage"));
@@ -46,7 +47,8 @@ class WebDavProviderTest : public ::testing::Test {
   [[nodiscard]] std::string localPath(const std::string &path) const {
     return folder_.path("group/Storix Storage/" + path);
   }
-  [[nodiscard]] URL item(const std::string &path) const { return *URL::fileURLWithPath(localPath(path)); }
+  ProviderExtension &extension() override { return provider(); }
+  [[nodiscard]] URL item(const std::string &path) const override { return *URL::fileURLWithPath(localPath(path)); }
   [[nodiscard]] std::string local(const std::string &path) const {
     return folder_.read("group/Storix Storage/" + path);
   }
@@ -58,28 +60,6 @@ class WebDavProviderTest : public ::testing::Test {
     return !isHere(".incoming") || std::filesystem::is_empty(localPath(".incoming"));
   }
 
-  template <class Outcome = std::optional<SXError>, class Call>
-  static Outcome answer(const Call &call) {
-    std::optional<Outcome> given;
-    call([&given](Outcome outcome) { given.emplace(std::move(outcome)); });
-    EXPECT_TRUE(given.has_value());
-    return *std::move(given);
-  }
-  std::optional<SXError> setUp() {
-    return answer([&](auto done) { provider().performInitialSetup(done); });
-  }
-  std::optional<SXError> start(const std::string &path) {
-    return answer([&](auto done) { provider().startProviding(item(path), done); });
-  }
-  std::optional<SXError> changed(const std::string &path) {
-    return answer([&](auto done) { provider().itemChanged(item(path), done); });
-  }
-  std::optional<SXError> stop(const std::string &path) {
-    return answer([&](auto done) { provider().stopProviding(item(path), done); });
-  }
-  Result<URL> placeholder(const std::string &path) {
-    return answer<Result<URL>>([&](auto done) { provider().providePlaceholder(item(path), done); });
-  }
   /// The document is on the server and here.
   void provide(const std::string &path, const std::string &content) {
     server_.write(path, content);
