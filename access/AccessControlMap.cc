@@ -42,15 +42,13 @@ Result<AccessControlMap> AccessControlMap::fromValue(Value content) {
       if (allowed == fields->end()) continue;
       const List *items = allowed->second.list();
       if (!items) return wrongShape("as AllowedItemIDs " + where, allowed->second, ValueKind::list);
-      Items &indexed = map.index_[provider][consumer];
-      indexed.reserve(items->size());
       for (std::size_t i = 0; i < items->size(); ++i) {
         const std::string *item = (*items)[i].string();
         if (!item) {
           return wrongShape("as item " + std::to_string(i) + " of AllowedItemIDs " + where, (*items)[i],
                             ValueKind::string);
         }
-        indexed.insert(*item);
+        map.index_.insert(provider, *item, consumer);
       }
     }
   }
@@ -60,14 +58,11 @@ Result<AccessControlMap> AccessControlMap::fromValue(Value content) {
 
 bool AccessControlMap::contains(const std::string &provider, const std::string &item,
                                 const std::string &consumer) const {
-  const auto consumers = index_.find(provider);
-  if (consumers == index_.end()) return false;
-  const auto items = consumers->second.find(consumer);
-  return items != consumers->second.end() && items->second.contains(item);
+  return index_.contains(provider, item, consumer);
 }
 
 bool AccessControlMap::add(const std::string &provider, const std::string &item, const std::string &consumer) {
-  if (!index_[provider][consumer].insert(item).second) return false;
+  if (!index_.insert(provider, item, consumer)) return false;
   Dictionary &consumers = *entryFor(dictionary_, provider, Dictionary()).dictionary();
   Dictionary &fields = *entryFor(consumers, consumer, Dictionary()).dictionary();
   entryFor(fields, allowedItemIDsKey, List()).list()->emplace_back(item);
@@ -75,8 +70,7 @@ bool AccessControlMap::add(const std::string &provider, const std::string &item,
 }
 
 bool AccessControlMap::remove(const std::string &provider, const std::string &item, const std::string &consumer) {
-  if (!contains(provider, item, consumer)) return false;
-  index_[provider][consumer].erase(item);
+  if (!index_.erase(provider, item, consumer)) return false;
 
   // What the index held stands in the dictionary too.
   const auto providerEntry = dictionary_.find(provider);
