@@ -150,6 +150,10 @@ bool BusConnection::step(Lock &lock) {
   if (verdict == FrameLimit::Verdict::nothing) return false;
   OwnedMessage message;
   int result = 0;
+  if (verdict == FrameLimit::Verdict::otherVersion) {
+    end(lock, posixError(EPROTO, "a message is not of version 1 of the D-Bus protocol"), false);
+    return false;
+  }
   if (verdict != FrameLimit::Verdict::tooLarge) {
     sd_bus_message *raw = nullptr;
     result = sd_bus_process(state.bus.get(), &raw);

@@ -11,6 +11,7 @@ namespace storix::wire {
 namespace {
 
 constexpr std::size_t fixedHeaderSize = 16;
+constexpr std::uint8_t protocolVersion = 1;
 using FixedHeader = std::array<std::uint8_t, fixedHeaderSize>;
 
 std::size_t numberAt(const FixedHeader &header, std::size_t offset) {
@@ -55,6 +56,8 @@ FrameLimit::Verdict FrameLimit::beforeProcess(int fd, bool hasUnwritten) {
   const ssize_t count = recv(fd, header.data(), header.size(), MSG_PEEK | MSG_DONTWAIT);
   if (count < 0 && (errno == EAGAIN || errno == EINTR) && !hasUnwritten) return Verdict::nothing;
   if (count == static_cast<ssize_t>(header.size()) && (header[0] == 'l' || header[0] == 'B')) {
+    // sd-bus would read a later version in its own way, and wait for what never comes.
+    if (header[3] != protocolVersion) return Verdict::otherVersion;
     if (messageSize(header) > maximumMessageSize) return Verdict::tooLarge;
     position_ = Position::inMessage;
     return Verdict::read;

@@ -15,7 +15,7 @@ inline constexpr std::size_t maximumMessageSize = std::size_t{1} << 20;
 /// is complete. Belongs to one connection and is guarded by its mutex.
 class FrameLimit {
  public:
-  enum class Verdict { read, nothing, tooLarge };
+  enum class Verdict { read, nothing, tooLarge, otherVersion };
 
   /// Before each `sd_bus_process`. `hasUnwritten` says that it has something to write; without, it
   /// need not be called when the answer is `nothing`.

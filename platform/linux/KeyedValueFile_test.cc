@@ -93,6 +93,16 @@ TEST(KeyedValueText, WholeNumbersTooLargeForAnIntegerAreRead) {
   EXPECT_EQ(*content.at("c").real(), 36893488147419103232.0);
 }
 
+TEST(KeyedValueText, NumbersWithExponentsAtTheirLimitsAreRead) {
+  const Dictionary content = parsed(R"({"a": 0e308, "b": -0e-400, "d": 1e-400, "e": 1e308, "f": 0.0e308})");
+  EXPECT_EQ(*content.at("a").real(), 0.0);
+  EXPECT_EQ(*content.at("b").real(), 0.0);
+  EXPECT_EQ(*content.at("d").real(), 0.0);
+  EXPECT_EQ(*content.at("e").real(), 1e308);
+  EXPECT_EQ(*content.at("f").real(), 0.0);
+  EXPECT_THAT(refusal(R"({"a": 1e309})"), HasSubstr("Number too big to be stored in double"));
+}
+
 TEST(KeyedValueText, SyntaxErrorSaysLineColumnAndByte) {
   EXPECT_THAT(refusal("{\n  \"a\": 1,\n  \"b\" 2\n}"),
               HasSubstr("sample.kvs: line 3, column 7 (byte 19): Missing a colon"));

@@ -49,7 +49,7 @@ INSTANTIATE_TEST_SUITE_P(
         Attack{"LoginThatNeverEnds", '\0' + std::string(std::size_t{1} << 17, 'A')},
         Attack{"JunkAfterTheLogin", std::string(loginBytes()) + std::string(64, '\xff')},
         Attack{"UnknownEndianness", message([](Message &made) { made.endianness = 'x'; })},
-        Attack{"BigEndianNumbersInALittleEndianMessage", message([](Message &made) { made.bodyLength = 0x01000000U; })},
+        Attack{"BigEndianNumbersInALittleEndianMessage", message([](Message &made) { made.bodyLength = 0x10000000U; })},
         Attack{"MessageOfFourGigabytes", message([](Message &made) { made.bodyLength = 0xfffffff0U; })},
         Attack{"HeaderFieldsOfFourGigabytes", message([](Message &made) { made.fieldsLength = 0xfffffff0U; })}),
     [](const auto &attack) { return std::string(attack.param.name); });
@@ -147,6 +147,22 @@ TEST_F(HostileLogin, MessageOfOneByteMoreEndsTheConnectionBeforeItHasCome) {
     EXPECT_TRUE(client.isClosed());
     EXPECT_TRUE(daemon->waitForLine("a message is larger than 1048576 bytes"));
   }
+  expectHealthy();
+}
+
+TEST_F(HostileLogin, MessageOfAnotherProtocolVersionEndsTheConnection) {
+  startWithBystander();
+  for (const int version : {0, 2, 255}) {
+    RawClient client = serviceClient();
+    ASSERT_EQ("", client.call(Message::service("WakeUp")));
+    ASSERT_EQ("", client.call(Message::service("WakeUp").numbered(2)));
+    Message other = Message::service("WakeUp").numbered(3);
+    other.version = static_cast<std::uint8_t>(version);
+    ASSERT_TRUE(client.send(other));
+    EXPECT_TRUE(client.isClosed()) << version;
+  }
+  EXPECT_TRUE(daemon->waitForLine("a message is not of version 1 of the D-Bus protocol"));
+  EXPECT_EQ(3U, daemon->countLines("Ended the connection of pid"));
   expectHealthy();
 }
 
