@@ -104,8 +104,8 @@ bool MessageBuilder::append(sd_bus_message *message, std::string_view type, int 
   const char container = isArray ? 'a' : kind == '(' ? 'r' : 'e';
   if (sd_bus_message_open_container(message, container, contents.c_str()) < 0) return false;
   if (isArray) {
-    const std::uint8_t count = depth < deepest ? nextByte() % mostElements : 0;
-    for (std::uint8_t i = 0; i < count; ++i) {
+    const int count = depth < deepest ? nextByte() % mostElements : 0;
+    for (int i = 0; i < count; ++i) {
       if (!append(message, contents, depth + 1)) return false;
     }
   } else {
