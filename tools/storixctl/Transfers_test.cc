@@ -229,12 +229,12 @@ TEST_F(TransfersTest, ADeadlineThatPassesSaysWhatToDo) {
 }
 
 TEST_F(TransfersTest, ABookmarkThatIsNotResolvedSaysWhatToDo) {
-  scripted()->onDocumentURL = [](const auto &, const auto &) {};
-  EXPECT_EQ(run({"cat", "storix:org.sample.docs/a/b"}, std::chrono::milliseconds(20)), daemonNotReachable);
-  EXPECT_THAT(complaint(), HasSubstr("\"storixctl providers\" must list “org.sample.docs”"));
-  scripted()->onDocumentURL = [](const auto &, const SXDaemon::DocumentReply &reply) {
+  scripted()->onDocumentURL = [](const std::string &bookmark, const SXDaemon::DocumentReply &reply) {
+    if (bookmark.ends_with("/unanswered")) return;
     reply(std::nullopt, std::nullopt, std::nullopt, std::nullopt, SXNotPermittedError());
   };
+  EXPECT_EQ(run({"cat", "storix:org.sample.docs/unanswered"}, std::chrono::milliseconds(20)), daemonNotReachable);
+  EXPECT_THAT(complaint(), HasSubstr("\"storixctl providers\" must list “org.sample.docs”"));
   for (const char *verb : {"cat", "write", "resolve"}) {
     EXPECT_EQ(writeFrom("x", {verb, "storix:org.sample.docs/a/b"}), requestFailed);
     EXPECT_THAT(complaint(), HasSubstr("\"storixctl extend DOCUMENT org.sample.docs CONSUMER\""));
