@@ -130,16 +130,16 @@ TEST_F(Completions, ZshKnowsEveryVerbAndOption) {
   for (const auto &verb : ctl::verbs()) {
     const std::string line = std::string(verb.name) + ":" + std::string(verb.summary) + "\n";
     EXPECT_NE(std::string::npos, verbs.find("\n" + line)) << line;
-    const std::string specifications = offeredByZsh(std::string(verb.name));
+    const std::string offers = offeredByZsh(std::string(verb.name));
     for (const auto &option : ctl::options()) {
       const std::string name = std::string(option.name) + (option.value.empty() ? "[" : "=[");
-      const bool offersIt = specifications.find(name) != std::string::npos;
+      const bool offersIt = offers.find(name) != std::string::npos;
       EXPECT_EQ(verb.takes(option.option), offersIt) << verb.name << " " << option.name;
       if (verb.takes(option.option) && !option.shortName.empty()) {
-        EXPECT_NE(std::string::npos, specifications.find(")" + std::string(option.shortName))) << option.shortName;
+        EXPECT_NE(std::string::npos, offers.find(")" + std::string(option.shortName))) << option.shortName;
       }
     }
-    EXPECT_EQ(verb.operands.empty(), specifications.rfind("\n1:") < specifications.rfind("->operands")) << verb.name;
+    EXPECT_EQ(verb.operands.empty(), offers.rfind("\n1:") < offers.rfind("->operands")) << verb.name;
   }
 }
 
