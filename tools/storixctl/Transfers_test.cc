@@ -365,12 +365,8 @@ TEST_F(TransfersTest, AReaderThatHasGoneIsNothingToSpeakOf) {
 TEST_F(TransfersTest, WaitingForTheProviderIsShownOnATerminal) {
   Terminal terminal;
   surroundings_.terminal = terminal.descriptor();
-  std::optional<Reply> reading;
-  std::mutex mutex;
-  daemon_->onBeginRead = [&](const auto &, const Reply &reply) {
-    const std::lock_guard lock(mutex);
-    reading = reply;
-  };
+  std::promise<Reply> reading;
+  daemon_->onBeginRead = [&reading](const auto &, const Reply &reply) { reading.set_value(reply); };
   directory_.write(".a", R"({"size": 2000000})");
   std::jthread provider([&] {
     terminal.waitFor("a: waiting, 2.0 MB, 0:0");
@@ -378,8 +374,7 @@ TEST_F(TransfersTest, WaitingForTheProviderIsShownOnATerminal) {
     fs::rename(directory_ / ".a.new", directory_ / ".a");
     terminal.waitFor("a: downloading, 500.0 kB of 2.0 MB (25 %), ");
     directory_.write("a", "here");
-    const std::lock_guard lock(mutex);
-    give(*reading);
+    give(reading.get_future().get());
   });
   EXPECT_EQ(contentOf({"read", "a"}), "here");
   provider.join();
