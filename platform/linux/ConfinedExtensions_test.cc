@@ -293,23 +293,14 @@ TEST_F(ConfinedExtensionTest, ProcessThatOutlivesItsConnectionIsEndedByTheSignal
   const Record extension = installedRecord("stays");
   const RequestIdentifier request = beginWell(extension);
   const Watched process(confinedProcess());
-  extension->cancelExtensionRequest(request);
-  time_.advance(10s);
-  ASSERT_TRUE(time_.waitForTaskIn(5s));
-  EXPECT_TRUE(process.isRunning());
-  time_.advance(5s);
-  EXPECT_TRUE(process.waitForExit());
+  expectEndByTheFirstSignal(extension, request, process);
 }
 
 TEST_F(ConfinedExtensionTest, TerminationSignalReachesTheProgramItself) {
   const Record extension = installedRecord("cleans-up");
   const RequestIdentifier request = beginWell(extension);
   const Watched process(startedProcess());
-  extension->cancelExtensionRequest(request);
-  time_.advance(10s);
-  ASSERT_TRUE(time_.waitForTaskIn(5s));
-  time_.advance(5s);
-  EXPECT_TRUE(process.waitForExit());
+  expectEndByTheFirstSignal(extension, request, process);
   // Its output is read to the end after it was reaped.
   const auto deadline = std::chrono::steady_clock::now() + 60s;
   while (linesWith("cleaned up").empty() && std::chrono::steady_clock::now() < deadline) std::this_thread::yield();
@@ -320,13 +311,7 @@ TEST_F(ConfinedExtensionTest, ProcessThatIgnoresTheTerminationSignalIsKilled) {
   const Record extension = installedRecord("ignores-termination");
   const RequestIdentifier request = beginWell(extension);
   const Watched process(confinedProcess());
-  extension->cancelExtensionRequest(request);
-  time_.advance(10s);
-  ASSERT_TRUE(time_.waitForTaskIn(10s));
-  time_.advance(5s);
-  EXPECT_TRUE(process.isRunning());
-  time_.advance(5s);
-  EXPECT_TRUE(process.waitForExit());
+  expectEndByTheSecondSignal(extension, request, process);
 }
 
 TEST_F(ConfinedExtensionTest, WhatItHasStartedEndsWithIt) {

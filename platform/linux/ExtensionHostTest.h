@@ -221,6 +221,27 @@ class ExtensionHostTest : public ::testing::Test {
     return 0;
   }
 
+  /// Ends the last request of an idle process that goes on: its connection is closed after ten seconds,
+  /// and five seconds later the first signal ends it.
+  void expectEndByTheFirstSignal(const Record &extension, const RequestIdentifier &request, const Watched &process) {
+    extension->cancelExtensionRequest(request);
+    time_.advance(std::chrono::seconds(10));
+    ASSERT_TRUE(time_.waitForTaskIn(std::chrono::seconds(5)));
+    EXPECT_TRUE(process.isRunning());
+    time_.advance(std::chrono::seconds(5));
+    EXPECT_TRUE(process.waitForExit());
+  }
+  /// The same of one that the first signal does not end: five seconds later the second one does.
+  void expectEndByTheSecondSignal(const Record &extension, const RequestIdentifier &request, const Watched &process) {
+    extension->cancelExtensionRequest(request);
+    time_.advance(std::chrono::seconds(10));
+    ASSERT_TRUE(time_.waitForTaskIn(std::chrono::seconds(10)));
+    time_.advance(std::chrono::seconds(5));
+    EXPECT_TRUE(process.isRunning());
+    time_.advance(std::chrono::seconds(5));
+    EXPECT_TRUE(process.waitForExit());
+  }
+
   static void waitUntilReaped(pid_t process) {
     const auto deadline = std::chrono::steady_clock::now() + 60s;
     while (::kill(process, 0) == 0 && std::chrono::steady_clock::now() < deadline) std::this_thread::yield();

@@ -120,25 +120,14 @@ TEST_F(ExtensionHostTest, ProcessThatOutlivesItsConnectionGetsTheTerminationSign
   const Record extension = installedRecord("stays");
   const RequestIdentifier request = beginWell(extension);
   const Watched process(processOf(extension, request));
-  extension->cancelExtensionRequest(request);
-  time_.advance(10s);
-  ASSERT_TRUE(time_.waitForTaskIn(5s));
-  EXPECT_TRUE(process.isRunning());
-  time_.advance(5s);
-  EXPECT_TRUE(process.waitForExit());
+  expectEndByTheFirstSignal(extension, request, process);
 }
 
 TEST_F(ExtensionHostTest, ProcessThatIgnoresTheTerminationSignalIsKilled) {
   const Record extension = installedRecord("ignores-termination");
   const RequestIdentifier request = beginWell(extension);
   const Watched process(processOf(extension, request));
-  extension->cancelExtensionRequest(request);
-  time_.advance(10s);
-  ASSERT_TRUE(time_.waitForTaskIn(10s));
-  time_.advance(5s);
-  EXPECT_TRUE(process.isRunning());
-  time_.advance(5s);
-  EXPECT_TRUE(process.waitForExit());
+  expectEndByTheSecondSignal(extension, request, process);
 }
 
 TEST_F(ExtensionHostTest, RequestThatComesWhileTheIdleProcessEndsGetsANewOne) {
