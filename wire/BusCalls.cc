@@ -9,6 +9,24 @@ namespace storix::wire {
 
 namespace {
 
+/// So much text costs no more than the message itself.
+constexpr std::size_t textPerPlace = 4096;
+
+std::size_t textSize(const Value &value) {
+  if (const std::string *text = value.string()) return text->size();
+  if (const URL *url = value.url()) return url->absoluteString().size();
+  if (const Data *data = value.data()) return data->bytes.size();
+  return 0;
+}
+
+/// The places that a message with these arguments takes while it waits: whoever waits for its answer most
+/// often keeps copies of them.
+std::size_t placesFor(const Arguments &arguments) {
+  std::size_t size = 0;
+  for (const Argument &argument : arguments) size += argument ? textSize(*argument) : 0;
+  return 1 + size / textPerPlace;
+}
+
 /// What a D-Bus error reply says, or none when the reply is none.
 std::optional<MethodFailure> errorOf(sd_bus_message *reply) {
   const sd_bus_error *error = sd_bus_message_get_error(reply);
@@ -31,8 +49,9 @@ void logRefusedReply(std::string_view method, const std::string &peer, const Met
 class OperationWaiter : public Waiter {
  public:
   OperationWaiter(LinkInterface interface, std::size_t operation, std::string peer, ReplyHandler reply,
-                  ConnectionErrorHandler errorHandler)
-      : interface_(std::move(interface)),
+                  ConnectionErrorHandler errorHandler, std::size_t places)
+      : Waiter(places),
+        interface_(std::move(interface)),
         operation_(operation),
         peer_(std::move(peer)),
         reply_(std::move(reply)),
@@ -71,7 +90,7 @@ class OperationWaiter : public Waiter {
 class MethodWaiter : public Waiter {
  public:
   MethodWaiter(const MethodDescription &method, std::string peer, MethodResultHandler handler)
-      : method_(method), peer_(std::move(peer)), handler_(std::move(handler)) {}
+      : Waiter(1), method_(method), peer_(std::move(peer)), handler_(std::move(handler)) {}
 
   Task answered(sd_bus_message *reply) override {
     if (std::optional<MethodFailure> error = errorOf(reply)) return failed(std::move(*error));
@@ -107,10 +126,12 @@ Task BusConnection::State::transmit(Outgoing &outgoing) {
   }
   std::uint64_t cookie = 0;
   const int sent = sd_bus_send(bus.get(), message.get(), outgoing.expectsReply ? &cookie : nullptr);
-  if (sent >= 0) {
-    if (outgoing.expectsReply) waiting.emplace(cookie, std::move(outgoing.waiter));
+  if (sent >= 0 && outgoing.expectsReply) {
+    waiting.emplace(cookie, std::move(outgoing.waiter));
     return {};
   }
+  placesTaken -= outgoing.waiter->places();
+  if (sent >= 0) return {};
   std::string why = busError(sent, "send").message();
   if (sent == -ECONNRESET || sent == -ENOTCONN || sent == -EPIPE) {
     return outgoing.waiter->failed(disconnected(std::move(why)));
@@ -136,12 +157,21 @@ void BusConnection::sendCall(const InterfaceDescription &interface, std::size_t 
     std::optional<MethodFailure> refused;
     if (state_->ended) {
       refused = disconnected("the connection has ended");
+    } else if (!state_->hasRoomFor(outgoing.waiter->places())) {
+      refused = {std::string(busErrorName::limitsExceeded),
+                 state_->options.peer + " has not answered " + std::to_string(state_->options.messagesWaitingAtMost) +
+                     " messages yet; try again when it has, or end it if it hangs"};
     } else if (made < 0) {
       refused = {std::string(busErrorName::limitsExceeded), busError(made, "make a message").message()};
     } else {
       refused = append(raw);
     }
-    failed = refused ? outgoing.waiter->failed(std::move(*refused)) : state_->transmit(outgoing);
+    if (refused) {
+      failed = outgoing.waiter->failed(std::move(*refused));
+    } else {
+      state_->placesTaken += outgoing.waiter->places();
+      failed = state_->transmit(outgoing);
+    }
     outgoing.message.reset();
     if (!state_->ended && state_->unwritten() > 0) wantedChanged = state_->wantedChangedHandler;
   }
@@ -166,7 +196,7 @@ struct BusConnection::Remote : RemoteObject {
         description, operation,
         [&row, &arguments](sd_bus_message *message) { return appendArguments(message, row, arguments); },
         std::make_unique<OperationWaiter>(interface, operation, connection->state_->options.peer, std::move(reply),
-                                          errorHandler),
+                                          errorHandler, placesFor(arguments)),
         expectsReply);
   }
 
@@ -197,6 +227,7 @@ void BusConnection::dispatchReply(Lock &lock, OwnedMessage message) {
   if (found == state_->waiting.end()) return;
   std::unique_ptr<Waiter> waiter = std::move(found->second);
   state_->waiting.erase(found);
+  state_->placesTaken -= waiter->places();
   Task task = waiter->answered(message.get());
   message.reset();
   lock.unlock();

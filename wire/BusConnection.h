@@ -3,6 +3,7 @@
 #include <chrono>
 #include <cstddef>
 #include <functional>
+#include <limits>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -53,6 +54,9 @@ class BusConnection : public std::enable_shared_from_this<BusConnection> {
     std::string peer;
     /// Requests of the peer that may be in flight before nothing more is read.
     std::size_t requestsInFlightAtMost = 256;
+    /// Messages to the peer that may wait for the login, for the socket or for their answers. A further one
+    /// fails at once. Each 4 KiB of text in a message count as one more.
+    std::size_t messagesWaitingAtMost = std::numeric_limits<std::size_t>::max();
     /// Runs a task soon, not inside this call: `ThreadPool::execute`, or the driving thread's own list.
     std::function<void(Task)> runLater;
   };

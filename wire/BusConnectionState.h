@@ -26,10 +26,16 @@ inline std::string_view textOrEmpty(const char *text) { return text ? std::strin
 /// gives runs without the connection's mutex.
 class Waiter {
  public:
+  explicit Waiter(std::size_t places) : places_(places) {}
   virtual ~Waiter() = default;
+  /// How many of the places for messages that wait the message takes.
+  [[nodiscard]] std::size_t places() const { return places_; }
   /// With the connection's mutex held.
   virtual Task answered(sd_bus_message *reply) = 0;
   virtual Task failed(MethodFailure failure) = 0;
+
+ private:
+  const std::size_t places_;
 };
 
 struct Outgoing {
@@ -93,6 +99,7 @@ struct BusConnection::State {
   // Messages to the peer: those that wait for the login, and by cookie those that wait for an answer.
   std::deque<Outgoing> unsent;
   std::map<std::uint64_t, std::unique_ptr<Waiter>> waiting;
+  std::size_t placesTaken = 0;  ///< By all of these.
 
   // Requests of the peer.
   std::size_t requestsInFlight = 0;
@@ -109,6 +116,11 @@ struct BusConnection::State {
     return sd_bus_get_n_queued_write(bus.get(), &count) >= 0 ? static_cast<std::size_t>(count) : 0;
   }
 
+  /// A message that wants no answer waits too, where the socket is full.
+  [[nodiscard]] bool hasRoomFor(std::size_t places) const {
+    return placesTaken + places <= options.messagesWaitingAtMost && unwritten() < options.messagesWaitingAtMost;
+  }
+
   void runLater(Task task) const {
     if (!task) return;
     if (options.runLater) {
@@ -118,9 +130,9 @@ struct BusConnection::State {
     }
   }
 
-  /// Sends the message, or keeps it until the login has ended. Gives what is to be run without the
-  /// mutex when it could not be sent. A waiter that has nothing more to wait for is left behind, and
-  /// goes without the mutex too.
+  /// Sends the message, which has its places, or keeps it until the login has ended. Gives what is to be run without
+  /// the mutex when it could not be sent. A waiter that has nothing more to wait for is left behind, and goes without
+  /// the mutex too.
   [[nodiscard]] Task transmit(Outgoing &outgoing);
 
   [[nodiscard]] bool answerByItself(sd_bus_message *request, const BusTarget &target) const;

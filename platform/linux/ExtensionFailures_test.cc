@@ -89,6 +89,44 @@ TEST_F(ExtensionFailureTest, ConnectionThatIsClosedByALivingProcessSaysSo) {
   EXPECT_TRUE(process.waitForExit());
 }
 
+TEST_F(ExtensionFailureTest, MessageBeyondThoseThatMayWaitFailsAtOnceAndOthersAreAnswered) {
+  const Record extension = installedRecord("answers");
+  const RequestIdentifier silent = beginWell(extension);
+  const RequestIdentifier refused = beginWell(extension);
+  const pid_t process = processOf(extension, silent);
+  std::vector<Later<Answer>> waiting;
+  for (int i = 0; i < 4096; ++i) waiting.push_back(askLater(extension, silent, "silence"));
+  const Answer failed = ask(extension, refused, "x");
+  ASSERT_TRUE(failed.failure);
+  EXPECT_EQ(failed.failure->details().at("busError"), Value("org.freedesktop.DBus.Error.LimitsExceeded"));
+  EXPECT_THAT(failed.failure->message(), HasSubstr("extension org.answers, pid " + std::to_string(process) +
+                                                   " has not answered 4096 messages yet"));
+  EXPECT_EQ(extension->extensionContextForRequest(refused), nullptr) << "its request has ended";
+  for (const Later<Answer> &answer : waiting) ASSERT_EQ(answer.count(), 0);
+  ::kill(process, SIGKILL);
+  for (Later<Answer> &answer : waiting) {
+    ASSERT_TRUE(isCode(answer.wait().failure, HostErrorCode::extensionKilled));
+  }
+  EXPECT_EQ(textFor(extension, beginWell(extension), "x"), "x");
+}
+
+TEST_F(ExtensionFailureTest, BeginBeyondThoseThatMayWaitForTheStartFailsAtOnce) {
+  const Record extension = installedRecord("never-logs-in");
+  std::vector<Later<Begun>> waiting;
+  for (int i = 0; i < 1024; ++i) waiting.push_back(beginLater(extension));
+  const std::optional<SXError> refused = failureOf(extension);
+  EXPECT_TRUE(isCode(refused, HostErrorCode::tooManyRequests));
+  EXPECT_EQ(refused->message(), "1024 requests wait already until the process of the extension " +
+                                    extension->description() + " has started; try again when it has.");
+  for (const Later<Begun> &begun : waiting) ASSERT_EQ(begun.count(), 0);
+  time_.advance(10s);
+  for (Later<Begun> &begun : waiting) ASSERT_TRUE(isCode(begun.wait().error, HostErrorCode::loginTimedOut));
+  // There is room again.
+  Later<Begun> next = beginLater(extension);
+  time_.advance(10s);
+  EXPECT_TRUE(isCode(next.wait().error, HostErrorCode::loginTimedOut));
+}
+
 TEST_F(ExtensionFailureTest, MissingExecutableFailsTheBegin) {
   install("answers");
   std::filesystem::remove(directory_ / "extensions/answers.appdex/answers");

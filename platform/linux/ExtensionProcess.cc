@@ -1,6 +1,7 @@
 #include "platform/linux/ExtensionProcess.h"
 
 #include <fcntl.h>
+#include <malloc.h>
 #include <poll.h>
 #include <sys/epoll.h>
 #include <sys/socket.h>
@@ -42,7 +43,8 @@ ExtensionProcess::ExtensionProcess(Surroundings surroundings, std::string name)
       name_(std::move(name)),
       lines_([this](std::string_view line) { sx_default_log().notice("[NOTICE] Extension %@: %@", name_, line); }) {}
 
-ExtensionProcess::~ExtensionProcess() = default;
+/// Whatever waited for the process is gone by now, and may have been much.
+ExtensionProcess::~ExtensionProcess() { ::malloc_trim(0); }
 
 void ExtensionProcess::start(LaunchDescription description, Handlers handlers) {
   handlers_ = std::move(handlers);
@@ -122,6 +124,7 @@ std::optional<SXError> ExtensionProcess::openConnection() {
   wire::BusConnection::Options options;
   options.side = wire::BusConnection::Side::server;
   options.peer = "extension " + name_ + ", pid " + std::to_string(processIdentifier_);
+  options.messagesWaitingAtMost = messagesWaitingAtMost;
   options.runLater = [&executor = surroundings_.executor](Task task) { executor.execute(std::move(task)); };
   Result<std::shared_ptr<wire::BusConnection>> opened = wire::BusConnection::open(std::move(socket_), options);
   if (!opened) return opened.error();

@@ -3,6 +3,7 @@
 #include <sys/types.h>
 
 #include <chrono>
+#include <cstddef>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -34,6 +35,9 @@ class ExtensionProcess : public std::enable_shared_from_this<ExtensionProcess> {
   static constexpr std::chrono::seconds timeUntilSignal{5};
   /// How long after the end of its connection the reason, an exit most often, is waited for.
   static constexpr std::chrono::seconds timeUntilExit{1};
+  /// Messages that it has not answered yet. Sixteen clients with all that they may have in flight; and as
+  /// requests that want no answer count nowhere else, what a process that hangs can cost the daemon.
+  static constexpr std::size_t messagesWaitingAtMost = 4096;
 
   /// All of them outlive the process.
   struct Surroundings {

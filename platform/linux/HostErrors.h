@@ -23,6 +23,7 @@ enum class HostErrorCode : std::int64_t {
   cannotStart = 9,       ///< what the daemon needs in order to start cannot be used; the text says what to do
   cannotConfine = 11,    ///< extensions may only run confined, and that does not work here
   notGranted = 12,       ///< an extension asks for a place that it may not have
+  tooManyRequests = 13,  ///< too many wait for the start of an extension already
   noAnswer = 10,         ///< a provider let go of a question without answering it
 };
 

@@ -90,6 +90,11 @@ void InstalledExtension::beginExtensionRequest(BeginHandler completion) {
       openRequest(process_, std::move(completion));
       return;
     }
+    if (!error && waiting_.size() >= waitingAtMost) {
+      error = hostError(HostErrorCode::tooManyRequests,
+                        std::to_string(waitingAtMost) + " requests wait already until the process of the extension " +
+                            description() + " has started; try again when it has.");
+    }
     if (!error) {
       waiting_.push_back({process_, std::move(completion), shared_from_this()});
       return;

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <chrono>
+#include <cstddef>
 #include <functional>
 #include <map>
 #include <memory>
@@ -35,6 +36,7 @@ class ExtensionSurroundings {
 /// The record of one installed bundle, and the life of its process: one at a time, started when a
 /// request begins, shared by all open requests, ended when there has been none for a while. Thread-safe.
 ///
+/// Begins that come while the process starts wait for it, so many at most; a further one fails at once.
 /// A process that fails fails the begins that wait for it and the messages in flight. After three
 /// failures in quick succession none is started for a while, and each begin fails at once.
 ///
@@ -47,6 +49,9 @@ class InstalledExtension : public ExtensionRecord, public std::enable_shared_fro
   static constexpr std::chrono::seconds failureWindow{10};
   static constexpr std::chrono::seconds timeLeftAlone{10};
   static constexpr int failuresAtMost = 3;
+  /// Begins that wait for a start, which may take until the login's time is over. As many as clients may
+  /// be connected: whoever asks for a document waits, and who floods is told so.
+  static constexpr std::size_t waitingAtMost = 1024;
 
   /// `executor` runs the begin handlers and gives the time; it must outlive the record. Requests of a
   /// record whose surroundings are gone fail.

@@ -6,8 +6,6 @@
 namespace storix::e2e {
 namespace {
 
-constexpr const char *hostile = "org.sample.hostile";
-
 struct Misdeed {
   const char *name;
   const char *script;
@@ -21,19 +19,6 @@ void PrintTo(const Misdeed &misdeed, std::ostream *out) { *out << misdeed.name; 
 
 class HostileExtensions : public HostileTest {
  protected:
-  void installHostile(const std::string &script) {
-    const std::filesystem::path staged = session.directory() / "hostile.staged";
-    std::filesystem::create_directory(staged);
-    session.write(staged / "script", script);
-    std::filesystem::copy_file(builtProgram("e2e_hostile_provider"), staged / "provider");
-    session.write(staged / "Info.kvs", R"({"KTBundleIdentifier": "org.sample.hostile", "KTBundleExecutable": "provider",
-        "KTBundleVersion": "1", "KTGroupContainers": ["group.org.sample.hostile"],
-        "KTExtensionPointIdentifier": "com.tessel.storix-nonui",
-        "KTExtension": {"KTExtensionStorixDocumentGroup": "group.org.sample.hostile"}})");
-    std::filesystem::rename(staged, session.extensionsDirectory() / "hostile.appdex");
-    std::filesystem::create_directories(session.storage(hostile));
-  }
-
   /// What it takes when the hostile provider's process runs as well.
   void startWithBoth(const std::string &script) {
     installHostile(script);

@@ -149,6 +149,101 @@ TEST_F(HostileFloods, RequestsThatWantNoAnswerKeepNobodyWaiting) {
   expectHealthy();
 }
 
+/// Requests without a reply to a provider that hangs: nothing but the limits of what waits for it holds them
+/// up.
+class FloodOfAProviderThatHangs : public HostileFloods {
+ protected:
+  void startWithHostile() {
+    // The rest would tell of every request.
+    session.environment["STORIX_LOG"] = "info";
+    installHostile("deaf");
+    startWithBystander();
+    ASSERT_TRUE(daemon->waitForLine("Registered storix provider extension org.sample.hostile"));
+    ASSERT_TRUE(bystander->extendSandbox(itemURL(hostile, "item"), hostile, "c"));
+    descriptors = descriptorsInUse();
+  }
+
+  /// From now on it reads nothing more. One message waits for its answer.
+  void deafen(const RawClient &client) const {
+    ASSERT_TRUE(client.send(Message::service("StartProvidingItemAtURL", "asasas",
+                                             itemArguments(itemURL(hostile, "item").absoluteString(), hostile, "c"))));
+    ASSERT_TRUE(daemon->waitForLine("Extension org.sample.hostile: deaf"));
+  }
+
+  /// Sends requests without a reply for an item whose name is that long, each of which asks the provider.
+  void flood(const RawClient &client, std::size_t nameLength, std::size_t count) {
+    Message request =
+        Message::service("ProvidePlaceholderForItemAtURL", "asasas",
+                         itemArguments(itemURL(hostile, std::string(nameLength, 'x')).absoluteString(), hostile, "c"));
+    request.flags = Message::noReplyExpected;
+    for (std::uint32_t serial = 2; serial < count + 2; ++serial) {
+      ASSERT_TRUE(client.send(request.numbered(serial)));
+      if (serial % 100 != 0) continue;
+      ASSERT_NO_FATAL_FAILURE(serveBystander());
+    }
+  }
+
+  /// So many of them failed, for the reason that stands in the lines. The bystander is served until then.
+  void expectFailed(std::size_t count, const std::string &reason) {
+    const auto failed = [this, &reason] {
+      std::size_t lines = 0;
+      for (const std::string &line : daemon->errorLines()) {
+        if (line.starts_with("[ERROR] Extension request failed.") || line.starts_with("[ERROR] Error getting remote")) {
+          lines += line.find(reason) != std::string::npos ? 1 : 0;
+        }
+      }
+      return lines;
+    };
+    const auto end = std::chrono::steady_clock::now() + deadline;
+    while (failed() < count && std::chrono::steady_clock::now() < end) ASSERT_NO_FATAL_FAILURE(serveBystander());
+    // Whatever came after them on another connection is answered later.
+    for (int i = 0; i < 50; ++i) ASSERT_NO_FATAL_FAILURE(serveBystander());
+    EXPECT_EQ(count, failed());
+  }
+};
+
+TEST_F(FloodOfAProviderThatHangs, FourThousandNinetySixMessagesWaitAndTheNextFails) {
+  startWithHostile();
+  {
+    const RawClient client = serviceClient();
+    ASSERT_NO_FATAL_FAILURE(deafen(client));
+    ASSERT_NO_FATAL_FAILURE(flood(client, 10, 4095 + 60));
+    ASSERT_NO_FATAL_FAILURE(expectFailed(60, "has not answered 4096 messages yet"));
+  }
+  ASSERT_NO_FATAL_FAILURE(killHostile());
+  expectHealthy();
+}
+
+TEST_F(FloodOfAProviderThatHangs, LongMessagesTakeThePlacesOfSeveralAndTheirMemoryComesBack) {
+  startWithHostile();
+  {
+    constexpr std::size_t length = 60000;
+    const std::size_t places = 1 + itemURL(hostile, std::string(length, 'x')).absoluteString().size() / 4096;
+    constexpr std::size_t count = 600;
+    const RawClient client = serviceClient();
+    ASSERT_NO_FATAL_FAILURE(deafen(client));
+    ASSERT_NO_FATAL_FAILURE(flood(client, length, count));
+    ASSERT_NO_FATAL_FAILURE(expectFailed(count - 4095 / places, "has not answered 4096 messages yet"));
+    // Of each there are five copies at most.
+    EXPECT_LT(memoryInUse(), memory + 5 * 4096 * std::size_t{4096} + memoryThatMayStay);
+  }
+  ASSERT_NO_FATAL_FAILURE(killHostile());
+  expectHealthy();
+}
+
+TEST_F(FloodOfAProviderThatHangs, ThousandAndTwentyFourRequestsWaitForItsStartAndTheNextFails) {
+  startWithHostile();
+  ASSERT_NO_FATAL_FAILURE(killHostile());
+  instructHostile("endless-login");
+  {
+    const RawClient client = serviceClient();
+    ASSERT_NO_FATAL_FAILURE(flood(client, 10, 1024 + 60));
+    ASSERT_NO_FATAL_FAILURE(expectFailed(60, "1024 requests wait already until the process of the extension"));
+  }
+  ASSERT_NO_FATAL_FAILURE(killHostile());
+  expectHealthy();
+}
+
 TEST_F(HostileFloods, ClientsGoneBeforeTheirAnswersAreForgotten) {
   session.installProvider("org.sample.silent", "start never");
   startWithBystander();

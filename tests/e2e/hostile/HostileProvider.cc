@@ -80,6 +80,12 @@ class Provider {
   void misbehave(sd_bus_message *call) {
     const std::map<std::string, std::function<void()>> misdeeds = {
         {"never", [] {}},
+        {"deaf",
+         [] {
+           std::puts("deaf");
+           std::fflush(stdout);
+           ::pause();
+         }},
         {"signature", [&] { sd_bus_reply_method_return(call, "ub", 4711U, 1); }},
         {"two-errors", [&] { twoErrors(call); }},
         {"twice", [&] { twice(call); }},
@@ -300,7 +306,8 @@ int main() {
   std::ifstream script(std::string(bundle ? bundle : ".") + "/script");
   std::string word;
   script >> word;
-  if (word == "no-login") ::pause();
+  if (word == "no-login") return 4;
+  if (word == "endless-login") ::pause();
   sd_bus *bus = nullptr;
   if (sd_bus_new(&bus) < 0 || sd_bus_set_fd(bus, fd, fd) < 0 || sd_bus_start(bus) < 0) return 1;
   Provider provider(bus, fd, word);

@@ -2,6 +2,7 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <signal.h>
 
 #include <filesystem>
 #include <fstream>
@@ -36,7 +37,43 @@ class HostileTest : public E2ETest {
   static constexpr std::size_t memoryThatMayStay = std::size_t{24} << 20;
 #endif
 
+  static constexpr const char *hostile = "org.sample.hostile";
+
   HostileTest() { session.installProvider(docs); }
+
+  /// Installs a provider that misbehaves as tests/e2e/hostile/HostileProvider.cc tells, and whose items are
+  /// those of "org.sample.hostile" whatever its identifier is.
+  void installHostile(const std::string &script, const std::string &identifier = hostile) {
+    std::filesystem::create_directories(session.storage(hostile));
+    const std::filesystem::path staged = session.directory() / "hostile.staged";
+    std::filesystem::create_directory(staged);
+    session.write(staged / "script", script);
+    std::filesystem::copy_file(builtProgram("e2e_hostile_provider"), staged / "provider");
+    session.write(staged / "Info.kvs",
+                  R"({"KTBundleIdentifier": ")" + identifier + R"(", "KTBundleExecutable": "provider",
+        "KTBundleVersion": "1", "KTGroupContainers": ["group.org.sample.hostile"],
+        "KTExtensionPointIdentifier": "com.tessel.storix-nonui",
+        "KTExtension": {"KTExtensionStorixDocumentGroup": "group.org.sample.hostile"}})");
+    std::filesystem::rename(staged, session.extensionsDirectory() / "hostile.appdex");
+  }
+  /// What its next process shall do.
+  void instructHostile(const std::string &script) {
+    session.write(session.extensionsDirectory() / "hostile.appdex/script", script);
+  }
+  /// Ends its process, and waits until the daemon knows.
+  void killHostile() {
+    const std::string beginning = "[INFO] Started process ";
+    pid_t process = 0;
+    for (const std::string &line : daemon->errorLines()) {
+      const std::size_t position = line.find(beginning);
+      if (position == std::string::npos || line.find(hostile) == std::string::npos) continue;
+      process = static_cast<pid_t>(std::stol(line.substr(position + beginning.size())));
+    }
+    ASSERT_GT(process, 0) << "it was never started";
+    const std::size_t before = daemon->errorLines().size();
+    ASSERT_EQ(0, ::kill(process, SIGKILL));
+    ASSERT_TRUE(daemon->waitForLine("was killed by signal 9", before));
+  }
 
   /// Starts the daemon, and takes what it has in use when all of it is running.
   void startWithBystander() {

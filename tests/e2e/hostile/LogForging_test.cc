@@ -24,17 +24,6 @@ class LogForging : public HostileTest {
     }
     expectHealthy();
   }
-
-  void installHostile(const std::string &identifier, const std::string &script) {
-    session.installBundle("hostile",
-                          R"({"KTBundleIdentifier": ")" + identifier +
-                              R"(", "KTBundleExecutable": "provider", "KTBundleVersion": "1",
-          "KTGroupContainers": ["group.org.sample.hostile"], "KTExtensionPointIdentifier": "com.tessel.storix-nonui",
-          "KTExtension": {"KTExtensionStorixDocumentGroup": "group.org.sample.hostile"}})",
-                          builtProgram("e2e_hostile_provider"));
-    session.write(session.extensionsDirectory() / "hostile.appdex/script", script);
-    std::filesystem::create_directories(session.storage("org.sample.hostile"));
-  }
 };
 
 TEST_F(LogForging, ConsumerIdentifierIsText) {
@@ -72,7 +61,7 @@ TEST_F(LogForging, BookmarkableStringIsText) {
 }
 
 TEST_F(LogForging, ProvidersErrorAndOutputAreText) {
-  installHostile("org.sample.hostile", "forge");
+  installHostile("forge");
   startWithBystander();
   ASSERT_TRUE(daemon->waitForLine("Registered storix provider extension org.sample.hostile"));
   const URL url = itemURL("org.sample.hostile", "item");
@@ -84,7 +73,7 @@ TEST_F(LogForging, ProvidersErrorAndOutputAreText) {
 }
 
 TEST_F(LogForging, DBusErrorOfAnExtensionIsText) {
-  installHostile("org.sample.hostile", "bus-error");
+  installHostile("bus-error");
   startWithBystander();
   ASSERT_TRUE(daemon->waitForLine("Registered storix provider extension org.sample.hostile"));
   const URL url = itemURL("org.sample.hostile", "item");
@@ -95,8 +84,20 @@ TEST_F(LogForging, DBusErrorOfAnExtensionIsText) {
 }
 
 TEST_F(LogForging, BundleIdentifierIsText) {
-  installHostile(R"(x\n[FORGED] line\r\u001b[31m %s %n)", "no-login");
+  const std::string identifier = "x\n[FORGED] line\r\x1b[31m %s %n";
+  // It starts well, so that nobody waits for further attempts.
+  installHostile("exit", R"(x\n[FORGED] line\r\u001b[31m %s %n)");
   startWithBystander();
+  ASSERT_TRUE(daemon->waitForLine(R"(Registered storix provider extension x\n[FORGED])"));
+  const URL url = itemURL(hostile, "item");
+  ASSERT_TRUE(bystander->extendSandbox(url, identifier, "c"));
+  EXPECT_TRUE(bystander->startProviding(url, identifier, "c"));
+  EXPECT_TRUE(daemon->waitForLine(R"([FORGED] line\r\x1b[31m %s %n exited with status 3.)"));
+  // From now on its process ends before it has logged in, until it is started no more.
+  instructHostile("no-login");
+  for (int i = 0; i < 3; ++i) EXPECT_TRUE(bystander->stopProviding(url, identifier, "c"));
+  EXPECT_TRUE(daemon->waitForLine(R"([FORGED] line\r\x1b[31m %s %n exited with status 4, before it had logged in.)"));
+  EXPECT_TRUE(daemon->waitForLine("failed three times"));
   expectNothingForged();
 }
 
