@@ -6,7 +6,7 @@ namespace {
 using testing::ElementsAre;
 using testing::HasSubstr;
 
-class BadInputTest : public BusConnectionTest {
+class BadInputTest : public EachFramingTest {
  protected:
   /// Sends one request to the daemon's interface and gives the name of the error that it got.
   template <class... Content>
@@ -62,7 +62,7 @@ class BadInputTest : public BusConnectionTest {
   std::optional<PlainClient> plain_;
 };
 
-TEST_F(BadInputTest, WrongSignatureIsRefusedWithOneLogLine) {
+TEST_P(BadInputTest, WrongSignatureIsRefusedWithOneLogLine) {
   exportDaemon(object_);
   EXPECT_EQ(refused("WakeUp", "s", "x"), busErrorName::invalidArgs);
   EXPECT_EQ(plain_->errorText, "the message must have the signature \"\", not \"s\"");
@@ -72,14 +72,14 @@ TEST_F(BadInputTest, WrongSignatureIsRefusedWithOneLogLine) {
   expectStillServed();
 }
 
-TEST_F(BadInputTest, TwoValuesWhereOneMayStandAreRefused) {
+TEST_P(BadInputTest, TwoValuesWhereOneMayStandAreRefused) {
   exportDaemon(object_);
   EXPECT_EQ(refused("StartProvidingItemAtURL", "asasas", 0, 2, "a", "b", 0), busErrorName::invalidArgs);
   EXPECT_EQ(plain_->errorText, "the argument \"providerID\" may have one value at most");
   expectStillServed();
 }
 
-TEST_F(BadInputTest, TextThatIsNoFileURLIsRefusedWithTheReason) {
+TEST_P(BadInputTest, TextThatIsNoFileURLIsRefusedWithTheReason) {
   exportDaemon(object_);
   EXPECT_EQ(refused("StartProvidingItemAtURL", "asasas", 1, "http://a/b", 0, 0), busErrorName::invalidArgs);
   EXPECT_THAT(plain_->errorText, HasSubstr("the argument \"URL\": "));
@@ -88,7 +88,7 @@ TEST_F(BadInputTest, TextThatIsNoFileURLIsRefusedWithTheReason) {
   expectStillServed();
 }
 
-TEST_F(BadInputTest, StringsAndURLsBeyondTheLimitAreRefused) {
+TEST_P(BadInputTest, StringsAndURLsBeyondTheLimitAreRefused) {
   exportDaemon(object_);
   const std::string fits(maximumStringSize, 'x');
   const std::string tooLong = fits + "x";
@@ -98,7 +98,7 @@ TEST_F(BadInputTest, StringsAndURLsBeyondTheLimitAreRefused) {
   expectStillServed();
 }
 
-TEST_F(BadInputTest, UnknownNamesHaveTheErrorsOfDBus) {
+TEST_P(BadInputTest, UnknownNamesHaveTheErrorsOfDBus) {
   exportDaemon(object_);
   EXPECT_EQ(refused("NoSuchMethod", ""), "org.freedesktop.DBus.Error.UnknownMethod");
   const auto call = [this](const char *path, const char *interface) {
@@ -110,7 +110,7 @@ TEST_F(BadInputTest, UnknownNamesHaveTheErrorsOfDBus) {
   expectStillServed();
 }
 
-TEST_F(BadInputTest, MessageBeyondTheLimitEndsTheConnectionWithOneLogLine) {
+TEST_P(BadInputTest, MessageBeyondTheLimitEndsTheConnectionWithOneLogLine) {
   exportDaemon(object_);
   plain_.emplace(std::move(peerSocket_));
   ASSERT_NE(plain_->call(plain_->message(daemonPath, "org.freedesktop.DBus.Peer", "Ping")), nullptr);
@@ -125,7 +125,7 @@ TEST_F(BadInputTest, MessageBeyondTheLimitEndsTheConnectionWithOneLogLine) {
   EXPECT_THAT(logTexts(), ElementsAre(HasSubstr("Ended the connection of pid 42")));
 }
 
-TEST_F(BadInputTest, FirstMessageBeyondTheLimitEndsTheConnection) {
+TEST_P(BadInputTest, FirstMessageBeyondTheLimitEndsTheConnection) {
   exportDaemon(object_);
   plain_.emplace(std::move(peerSocket_));
   const std::string large(8 * maximumMessageSize, 'x');
@@ -137,7 +137,7 @@ TEST_F(BadInputTest, FirstMessageBeyondTheLimitEndsTheConnection) {
   EXPECT_EQ(error->code(), EMSGSIZE);
 }
 
-TEST_F(BadInputTest, MessageJustBelowTheLimitIsRead) {
+TEST_P(BadInputTest, MessageJustBelowTheLimitIsRead) {
   exportDaemon(object_);
   plain_.emplace(std::move(peerSocket_));
   ASSERT_NE(plain_->call(plain_->message(daemonPath, "org.freedesktop.DBus.Peer", "Ping")), nullptr);
@@ -146,21 +146,21 @@ TEST_F(BadInputTest, MessageJustBelowTheLimitIsRead) {
   expectStillServed();
 }
 
-TEST_F(BadInputTest, JunkInsteadOfALoginEndsTheConnectionWithOneLogLine) {
+TEST_P(BadInputTest, JunkInsteadOfALoginEndsTheConnectionWithOneLogLine) {
   exportDaemon(object_);
   ASSERT_EQ(write(peerSocket_.get(), "GET / HTTP/1.1\r\n\r\n", 18), 18);
   EXPECT_TRUE(closed_.take());
   EXPECT_THAT(logTexts(), ElementsAre(HasSubstr("Ended the connection of pid 42: ")));
 }
 
-TEST_F(BadInputTest, JunkAfterTheLoginEndsTheConnectionWithOneLogLine) {
+TEST_P(BadInputTest, JunkAfterTheLoginEndsTheConnectionWithOneLogLine) {
   exportDaemon(object_);
   sendRaw(loginBytes() + "this is no message, see");
   EXPECT_TRUE(closed_.take());
   EXPECT_THAT(logTexts(), ElementsAre(HasSubstr("Ended the connection of pid 42: ")));
 }
 
-TEST_F(BadInputTest, MessagesThatComeWithTheEndOfTheLoginAreServed) {
+TEST_P(BadInputTest, MessagesThatComeWithTheEndOfTheLoginAreServed) {
   exportDaemon(object_);
   sendRaw(loginBytes() + wakeUpBytes(1) + wakeUpBytes(2));
   EXPECT_TRUE(object_->requests.take());
@@ -169,7 +169,7 @@ TEST_F(BadInputTest, MessagesThatComeWithTheEndOfTheLoginAreServed) {
   EXPECT_TRUE(object_->requests.take());
 }
 
-TEST_F(BadInputTest, MessageInPiecesIsServed) {
+TEST_P(BadInputTest, MessageInPiecesIsServed) {
   exportDaemon(object_);
   const std::string message = wakeUpBytes(1);
   sendRaw(loginBytes() + message);
@@ -183,7 +183,7 @@ TEST_F(BadInputTest, MessageInPiecesIsServed) {
   }
 }
 
-// --- What every object answers, and interfaces that are described by hand
+INSTANTIATE_TEST_SUITE_P(Wire, BadInputTest, EachFramingTest::each(), EachFramingTest::name);
 
 }  // namespace
 }  // namespace storix::wire

@@ -9,6 +9,8 @@
 
 #include "platform/Log.h"
 #include "wire/BusConnectionState.h"
+#include "wire/FrameGate.h"
+#include "wire/FrameLimit.h"
 
 namespace storix::wire {
 
@@ -28,6 +30,31 @@ void logEnd(const std::string &peer, const SXError &reason) {
   sx_default_log().notice("[NOTICE] Ended the connection of %@: %@", peer, reason);
 }
 
+SXError brokenConnection(int errorNumber, bool loggedIn) {
+  return posixError(errorNumber, loggedIn ? "the peer closed or broke the connection" : "the login failed");
+}
+
+/// What a connection is ended with.
+SXError refusal(Framing::Verdict verdict, bool loggedIn) {
+  switch (verdict) {
+    case Framing::Verdict::loginTooLong:
+      return posixError(EMSGSIZE, "the login failed");
+    case Framing::Verdict::noMessage:
+      return posixError(EBADMSG, "what came is no message of the D-Bus protocol");
+    case Framing::Verdict::otherVersion:
+      return posixError(EPROTO, "a message is not of version 1 of the D-Bus protocol");
+    case Framing::Verdict::tooLarge:
+      return posixError(EMSGSIZE, "a message is larger than " + std::to_string(maximumMessageSize) + " bytes");
+    case Framing::Verdict::unwantedDescriptor:
+      return posixError(EPROTO, "a message carries a file descriptor that nothing here takes");
+    case Framing::Verdict::ended:
+    case Framing::Verdict::read:
+    case Framing::Verdict::nothing:
+      break;
+  }
+  return brokenConnection(ECONNRESET, loggedIn);
+}
+
 bool isWritable(int fd) {
   pollfd waited{fd, POLLOUT, 0};
   return poll(&waited, 1, 0) > 0 && (waited.revents & POLLOUT) != 0;
@@ -44,23 +71,34 @@ Result<std::shared_ptr<BusConnection>> BusConnection::open(UniqueFd socket, Opti
   sd_bus *raw = nullptr;
   int result = sd_bus_new(&raw);
   if (result < 0) return busError(result, "make a D-Bus connection");
-  OwnedBus bus(raw);
+  auto state = std::make_unique<State>();
+  state->bus.reset(raw);
   const int fd = socket.get();
-  result = sd_bus_set_fd(raw, fd, fd);
+  const bool passesDescriptors = options.descriptors == Descriptors::passed;
+  UniqueFd gated;
+  if (options.side == Side::server && passesDescriptors) {
+    state->framing = FrameGate::make(
+        [state = state.get()](const BusTarget &target, std::string_view signature) {
+          return state->takesDescriptor(target, signature);
+        },
+        gated);
+    if (!state->framing) return posixError(errno, "make a socket pair for " + options.peer);
+  } else {
+    state->framing = std::make_unique<FrameLimit>();
+  }
+  result = sd_bus_set_fd(raw, gated ? gated.get() : fd, fd);
   if (result < 0) return busError(result, "use the socket of " + options.peer);
+  (void)gated.release();
   (void)socket.release();
   if (options.side == Side::server) result = sd_bus_set_server(raw, 1, serverIdentity());
-  if (result >= 0) result = sd_bus_negotiate_fds(raw, options.descriptors == Descriptors::passed ? 1 : 0);
+  if (result >= 0) result = sd_bus_negotiate_fds(raw, passesDescriptors ? 1 : 0);
   if (result >= 0) result = sd_bus_start(raw);
   if (result < 0) {
     SXError error = busError(result, "the login failed");
     logEnd(options.peer, error);
     return error;
   }
-
-  auto state = std::make_unique<State>();
   state->options = std::move(options);
-  state->bus = std::move(bus);
   return std::shared_ptr<BusConnection>(new BusConnection(std::move(state), fd));
 }
 
@@ -97,6 +135,7 @@ void BusConnection::releaseSocket() {
   close();
   const std::lock_guard lock(state_->mutex);
   sd_bus_close(state_->bus.get());
+  state_->framing->release();
 }
 
 BusConnection::Wanted BusConnection::wanted() {
@@ -110,7 +149,7 @@ BusConnection::Wanted BusConnection::wanted() {
     wanted.events |= POLLOUT;
   } else if (state_->isFull()) {
     wanted.events = static_cast<short>(wanted.events & ~POLLIN);
-  } else if (!state_->held.empty()) {
+  } else if (!state_->held.empty() || state_->framing->holdsUnread()) {
     // A request is here already. The socket says at once that it may be written to.
     wanted.events |= POLLOUT;
   }
@@ -146,42 +185,34 @@ bool BusConnection::step(Lock &lock) {
     return false;
   }
 
-  FrameLimit::Verdict verdict = state.frames.beforeProcess(fd_, writes);
-  if (verdict == FrameLimit::Verdict::nothing) return false;
+  Framing::Verdict verdict = state.framing->beforeProcess(fd_, writes);
+  if (verdict == Framing::Verdict::nothing) return false;
   OwnedMessage message;
   int result = 0;
-  if (verdict == FrameLimit::Verdict::otherVersion) {
-    end(lock, posixError(EPROTO, "a message is not of version 1 of the D-Bus protocol"), false);
-    return false;
-  }
-  if (verdict != FrameLimit::Verdict::tooLarge) {
+  if (verdict == Framing::Verdict::read) {
     sd_bus_message *raw = nullptr;
     result = sd_bus_process(state.bus.get(), &raw);
     message.reset(raw);
-    const bool open = sd_bus_is_open(state.bus.get()) > 0;
-    if (result < 0 || !open) {
-      const int reason = result < 0 ? -result : ECONNRESET;
-      message.reset();
-      end(lock, posixError(reason, state.loggedIn ? "the peer closed or broke the connection" : "the login failed"),
-          false);
-      return false;
+    if (result >= 0 && sd_bus_is_open(state.bus.get()) <= 0) result = -ECONNRESET;
+    if (result >= 0) {
+      const bool isReady = sd_bus_is_ready(state.bus.get()) > 0;
+      verdict = state.framing->afterProcess(fd_, {isReady, message != nullptr, result == 0});
     }
-    verdict = state.frames.afterProcess(fd_, sd_bus_is_ready(state.bus.get()) > 0, message != nullptr, result == 0);
   }
-  if (verdict == FrameLimit::Verdict::tooLarge) {
+  if (result < 0 || verdict != Framing::Verdict::read) {
     message.reset();
-    end(lock, posixError(EMSGSIZE, "a message is larger than " + std::to_string(maximumMessageSize) + " bytes"), false);
+    end(lock, result < 0 ? brokenConnection(-result, state.loggedIn) : refusal(verdict, state.loggedIn), false);
     return false;
   }
   if (!state.loggedIn && sd_bus_is_ready(state.bus.get()) > 0) loggedIn(lock);
-  if (!message) return result > 0;
+  if (!message) return result > 0 || state.framing->holdsUnread();
   if (state.isFull()) {
     state.held.push_back(std::move(message));
     return true;
   }
   dispatch(lock, std::move(message));
   // Whatever comes next lies in the socket, and whoever waits for that sees it.
-  return !(state.frames.atBoundary() && state.held.empty());
+  return !(state.framing->atBoundary() && state.held.empty());
 }
 
 void BusConnection::loggedIn(Lock &lock) {

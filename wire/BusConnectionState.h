@@ -14,8 +14,9 @@
 #include <vector>
 
 #include "wire/BusConnection.h"
+#include "wire/BusTarget.h"
 #include "wire/Codec.h"
-#include "wire/FrameLimit.h"
+#include "wire/Framing.h"
 #include "wire/SdBus.h"
 
 namespace storix::wire {
@@ -65,17 +66,6 @@ struct BusExport {
   std::vector<BusConnection::MethodHandler> handlers;  ///< Of an interface that is described by hand.
 };
 
-/// What a request is addressed to, as it lies in the message.
-struct BusTarget {
-  std::string_view path;
-  std::string_view interface;  ///< Empty where the caller leaves it open.
-  std::string_view member;
-
-  [[nodiscard]] bool names(std::string_view wantedInterface, std::string_view wantedMember) const {
-    return member == wantedMember && (interface.empty() || interface == wantedInterface);
-  }
-};
-
 struct BusMethod {
   std::shared_ptr<const BusExport> exported;
   std::size_t index;
@@ -87,7 +77,7 @@ struct BusConnection::State {
 
   std::mutex mutex;
   OwnedBus bus;
-  FrameLimit frames;
+  std::unique_ptr<Framing> framing;
   bool begun = false;
   bool loggedIn = false;
   bool ended = false;
@@ -137,6 +127,8 @@ struct BusConnection::State {
 
   [[nodiscard]] bool answerByItself(sd_bus_message *request, const BusTarget &target) const;
   [[nodiscard]] std::variant<BusMethod, MethodFailure> find(const BusTarget &target) const;
+  /// Whether that is a method of ours which takes one file descriptor.
+  [[nodiscard]] bool takesDescriptor(const BusTarget &target, std::string_view signature) const;
 
   /// Answers a request with a D-Bus error, if it expects an answer.
   static void replyFailure(sd_bus_message *request, const MethodFailure &failure) {

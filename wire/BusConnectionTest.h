@@ -59,12 +59,14 @@ inline std::size_t rowOf(std::string_view method) {
 
 class BusConnectionTest : public testing::Test {
  protected:
-  BusConnectionTest() {
+  using Descriptors = BusConnection::Descriptors;
+
+  explicit BusConnectionTest(Descriptors descriptors = Descriptors::passed) {
     auto [ours, theirs] = makeSocketPair();
     peerSocket_ = std::move(theirs);
     BusConnection::Options options;
     options.side = BusConnection::Side::server;
-    options.descriptors = BusConnection::Descriptors::passed;
+    options.descriptors = descriptors;
     options.peer = "pid 42";
     server_.emplace(pool_, std::move(ours), std::move(options));
     (*server_)->setClosedHandler([this](const SXError &error) { closed_.put(error); });
@@ -109,6 +111,18 @@ class BusConnectionTest : public testing::Test {
   ThreadPool pool_;
   std::optional<TestConnection> server_;
   std::optional<TestConnection> client_;
+};
+
+/// Run with each way in which what the peer sends is cut into messages.
+class EachFramingTest : public BusConnectionTest, public testing::WithParamInterface<BusConnection::Descriptors> {
+ public:
+  static auto each() { return testing::Values(Descriptors::refused, Descriptors::passed); }
+  static std::string name(const testing::TestParamInfo<Descriptors> &tested) {
+    return tested.param == Descriptors::passed ? "WithDescriptors" : "WithoutDescriptors";
+  }
+
+ protected:
+  EachFramingTest() : BusConnectionTest(GetParam()) {}
 };
 
 }  // namespace storix::wire

@@ -6,7 +6,11 @@ namespace {
 using testing::Contains;
 using testing::HasSubstr;
 
-TEST_F(BusConnectionTest, EveryKindTravelsBothWays) {
+class ConnectionTest : public EachFramingTest {};
+
+INSTANTIATE_TEST_SUITE_P(Wire, ConnectionTest, EachFramingTest::each(), EachFramingTest::name);
+
+TEST_P(ConnectionTest, EveryKindTravelsBothWays) {
   exportDaemon(object_);
   const URL url = *URL::fromString("file:///a%20b/%C3%A9");
   remote()->send(rowOf("ExtendSandboxForFileURL"), {Value(url), Value("org.sample"), std::nullopt}, toReplies());
@@ -25,7 +29,7 @@ TEST_F(BusConnectionTest, EveryKindTravelsBothWays) {
   EXPECT_EQ(replies_.take(), answer);
 }
 
-TEST_F(BusConnectionTest, AnEmptyStringIsNotAnAbsentOne) {
+TEST_P(ConnectionTest, AnEmptyStringIsNotAnAbsentOne) {
   exportDaemon(object_);
   remote()->send(rowOf("StartProvidingItemAtURL"), {std::nullopt, Value(""), std::nullopt}, toReplies());
   auto request = object_->requests.take();
@@ -35,7 +39,7 @@ TEST_F(BusConnectionTest, AnEmptyStringIsNotAnAbsentOne) {
   EXPECT_EQ(replies_.take(), Arguments{std::nullopt});
 }
 
-TEST_F(BusConnectionTest, RepliesComeLaterFromOtherThreadsAndInAnyOrder) {
+TEST_P(ConnectionTest, RepliesComeLaterFromOtherThreadsAndInAnyOrder) {
   exportDaemon(object_);
   const auto remoteObject = remote();
   constexpr int count = 20;
@@ -61,7 +65,7 @@ TEST_F(BusConnectionTest, RepliesComeLaterFromOtherThreadsAndInAnyOrder) {
   }
 }
 
-TEST_F(BusConnectionTest, SecondReplyIsDropped) {
+TEST_P(ConnectionTest, SecondReplyIsDropped) {
   exportDaemon(object_);
   remote()->send(rowOf("WakeUp"), {}, toReplies());
   auto request = object_->requests.take();
@@ -77,7 +81,7 @@ TEST_F(BusConnectionTest, SecondReplyIsDropped) {
   EXPECT_EQ(replies_.count(), 0U);
 }
 
-TEST_F(BusConnectionTest, CallWithoutReplyIsARequestWithoutReplyHandler) {
+TEST_P(ConnectionTest, CallWithoutReplyIsARequestWithoutReplyHandler) {
   exportDaemon(object_);
   remote()->send(rowOf("WakeUp"), {}, {});
   auto request = object_->requests.take();
@@ -85,7 +89,7 @@ TEST_F(BusConnectionTest, CallWithoutReplyIsARequestWithoutReplyHandler) {
   EXPECT_FALSE(request->reply);
 }
 
-TEST_F(BusConnectionTest, EachMessageInFlightHearsOnceThatThePeerIsGone) {
+TEST_P(ConnectionTest, EachMessageInFlightHearsOnceThatThePeerIsGone) {
   exportDaemon(object_);
   const auto remoteObject = remote();
   Received<SXError> clientClosed;
@@ -110,7 +114,7 @@ TEST_F(BusConnectionTest, EachMessageInFlightHearsOnceThatThePeerIsGone) {
   EXPECT_TRUE(closed_.take());
 }
 
-TEST_F(BusConnectionTest, MessageToAConnectionThatHasEndedFailsOutsideTheCall) {
+TEST_P(ConnectionTest, MessageToAConnectionThatHasEndedFailsOutsideTheCall) {
   exportDaemon(object_);
   const auto remoteObject = remote();
   client()->close();
@@ -127,7 +131,7 @@ TEST_F(BusConnectionTest, MessageToAConnectionThatHasEndedFailsOutsideTheCall) {
   EXPECT_TRUE(errors_.take());
 }
 
-TEST_F(BusConnectionTest, DBusErrorReplyReachesTheErrorHandlerAndSaysWhich) {
+TEST_P(ConnectionTest, DBusErrorReplyReachesTheErrorHandlerAndSaysWhich) {
   server_->start();
   remote()->send(rowOf("WakeUp"), {}, toReplies());
   auto error = errors_.take();
@@ -136,7 +140,7 @@ TEST_F(BusConnectionTest, DBusErrorReplyReachesTheErrorHandlerAndSaysWhich) {
   EXPECT_THAT(error->message(), HasSubstr(daemonPath));
 }
 
-TEST_F(BusConnectionTest, ReplyOfAnotherSignatureReachesTheErrorHandler) {
+TEST_P(ConnectionTest, ReplyOfAnotherSignatureReachesTheErrorHandler) {
   static const InterfaceDescription wrong{
       "com.tessel.Storix.Daemon", "/com/tessel/Storix", {{"WakeUp", {}, {{"surprise", "t"}}}}};
   (*server_)->exportMethods(wrong, {[](MethodValues, const BusConnection::Reply &reply) {
@@ -153,7 +157,7 @@ TEST_F(BusConnectionTest, ReplyOfAnotherSignatureReachesTheErrorHandler) {
   EXPECT_THAT(logTexts(), Contains(HasSubstr("Refused the reply to \"WakeUp\" from the daemon")));
 }
 
-TEST_F(BusConnectionTest, ReplyWithAKindThatIsNotPermittedIsWithheld) {
+TEST_P(ConnectionTest, ReplyWithAKindThatIsNotPermittedIsWithheld) {
   const Dictionary record{{"org.sample", Value(Dictionary{{"count", Value(1)}})}};
   exportDaemon(std::make_shared<AnsweringObject>(Arguments{std::nullopt, Value(record)}));
   remote()->send(rowOf("Providers"), {}, toReplies());
@@ -163,7 +167,7 @@ TEST_F(BusConnectionTest, ReplyWithAKindThatIsNotPermittedIsWithheld) {
   EXPECT_THAT(logTexts(), Contains(HasSubstr("Withheld the reply to \"Providers\" of pid 42")));
 }
 
-TEST_F(BusConnectionTest, PermittedKindsPass) {
+TEST_P(ConnectionTest, PermittedKindsPass) {
   const URL url = *URL::fromString("file:///a/");
   const Dictionary record{{"org.sample", Value(Dictionary{{"name", Value("n")}, {"URL", Value(url)}})}};
   exportDaemon(std::make_shared<AnsweringObject>(Arguments{std::nullopt, Value(record)}));
@@ -171,7 +175,7 @@ TEST_F(BusConnectionTest, PermittedKindsPass) {
   EXPECT_EQ(replies_.take(), (Arguments{std::nullopt, Value(record)}));
 }
 
-TEST_F(BusConnectionTest, ReplyThatIsTooLargeIsAnErrorAndTheConnectionLives) {
+TEST_P(ConnectionTest, ReplyThatIsTooLargeIsAnErrorAndTheConnectionLives) {
   exportDaemon(object_);
   remote()->send(rowOf("ExtendSandboxForFileURL"), {{}, {}, {}}, toReplies());
   auto request = object_->requests.take();
@@ -187,7 +191,7 @@ TEST_F(BusConnectionTest, ReplyThatIsTooLargeIsAnErrorAndTheConnectionLives) {
   EXPECT_TRUE(replies_.take());
 }
 
-TEST_F(BusConnectionTest, CallThatIsTooLargeFailsAndTheConnectionLives) {
+TEST_P(ConnectionTest, CallThatIsTooLargeFailsAndTheConnectionLives) {
   exportDaemon(object_);
   const auto remoteObject = remote();
   remoteObject->send(rowOf("StartProvidingItemAtURL"), {{}, Value(std::string(maximumStringSize + 1, 'x')), {}},
@@ -202,7 +206,7 @@ TEST_F(BusConnectionTest, CallThatIsTooLargeFailsAndTheConnectionLives) {
   EXPECT_TRUE(replies_.take());
 }
 
-TEST_F(BusConnectionTest, RepliesWaitForAPeerThatDoesNotRead) {
+TEST_P(ConnectionTest, RepliesWaitForAPeerThatDoesNotRead) {
   // Far more than a socket holds, so that most of it has to be written later.
   const Data large{std::string(900'000, 'x')};
   exportDaemon(std::make_shared<AnsweringObject>(Arguments{std::nullopt, Value(large), std::nullopt, std::nullopt}));
@@ -228,7 +232,7 @@ TEST_F(BusConnectionTest, RepliesWaitForAPeerThatDoesNotRead) {
   }
 }
 
-TEST_F(BusConnectionTest, TheRequestAfterTheLimitWaitsUntilOneIsAnswered) {
+TEST_P(ConnectionTest, TheRequestAfterTheLimitWaitsUntilOneIsAnswered) {
   constexpr std::size_t limit = 256;
   exportDaemon(object_);
   const auto remoteObject = remote();
@@ -244,7 +248,7 @@ TEST_F(BusConnectionTest, TheRequestAfterTheLimitWaitsUntilOneIsAnswered) {
   EXPECT_TRUE(replies_.take());
 }
 
-TEST_F(BusConnectionTest, RequestsLeftUnansweredDoNotCountOnceTheyAreLetGo) {
+TEST_P(ConnectionTest, RequestsLeftUnansweredDoNotCountOnceTheyAreLetGo) {
   constexpr std::size_t limit = 256;
   exportDaemon(object_);
   const auto remoteObject = remote();
@@ -253,7 +257,7 @@ TEST_F(BusConnectionTest, RequestsLeftUnansweredDoNotCountOnceTheyAreLetGo) {
   EXPECT_EQ(replies_.count(), 0U);
 }
 
-TEST_F(BusConnectionTest, PeerThatGoesWithTooManyRequestsInFlightIsNoticed) {
+TEST_P(ConnectionTest, PeerThatGoesWithTooManyRequestsInFlightIsNoticed) {
   constexpr std::size_t limit = 256;
   exportDaemon(object_);
   const auto remoteObject = remote();
@@ -265,7 +269,7 @@ TEST_F(BusConnectionTest, PeerThatGoesWithTooManyRequestsInFlightIsNoticed) {
   EXPECT_TRUE(closed_.take());
 }
 
-TEST_F(BusConnectionTest, TheObjectIsLetGoOfWhenTheConnectionEndsThoughARequestIsUnanswered) {
+TEST_P(ConnectionTest, TheObjectIsLetGoOfWhenTheConnectionEndsThoughARequestIsUnanswered) {
   const std::weak_ptr<RecordingObject> weak = object_;
   exportDaemon(object_);
   remote()->send(rowOf("WakeUp"), {}, toReplies());
@@ -279,7 +283,7 @@ TEST_F(BusConnectionTest, TheObjectIsLetGoOfWhenTheConnectionEndsThoughARequestI
   request->reply({});
 }
 
-TEST_F(BusConnectionTest, ObjectThatOwnsTheRepliesToItselfIsLetGoOfToo) {
+TEST_P(ConnectionTest, ObjectThatOwnsTheRepliesToItselfIsLetGoOfToo) {
   const std::weak_ptr<RecordingObject> weak = object_;
   exportDaemon(object_);
   const auto remoteObject = remote();
@@ -295,7 +299,7 @@ TEST_F(BusConnectionTest, ObjectThatOwnsTheRepliesToItselfIsLetGoOfToo) {
 
 // --- What bad input gets
 
-TEST_F(BusConnectionTest, RequestThatWasThereBeforeTheConnectionIsServed) {
+TEST_P(ConnectionTest, RequestThatWasThereBeforeTheConnectionIsServed) {
   auto [ours, theirs] = makeSocketPair();
   std::optional<PlainClient> plain(std::move(theirs));
   BusConnection::Options options;

@@ -155,6 +155,14 @@ std::variant<BusMethod, MethodFailure> BusConnection::State::find(const BusTarge
   return MethodFailure{SD_BUS_ERROR_UNKNOWN_METHOD, "there is no method \"" + std::string(target.member) + "\""};
 }
 
+bool BusConnection::State::takesDescriptor(const BusTarget &target, std::string_view signature) const {
+  const auto found = find(target);
+  const BusMethod *method = std::get_if<BusMethod>(&found);
+  if (!method) return false;
+  const std::string &taken = method->exported->interface->description.methods[method->index].inSignature;
+  return taken == signature && std::ranges::count(taken, 'h') == 1;
+}
+
 void BusConnection::refuse(OwnedMessage message, const MethodFailure &failure) const {
   sx_default_log().notice("[NOTICE] Refused \"%@\" of %@: %@ (%@)",
                           textOrEmpty(sd_bus_message_get_member(message.get())), state_->options.peer, failure.text,

@@ -9,7 +9,7 @@
 #include <vector>
 
 #include "platform/Protocol.h"
-#include "wire/FrameLimit.h"
+#include "wire/Framing.h"
 #include "wire/SdBus.h"
 #include "wire/Signature.h"
 

@@ -11,8 +11,8 @@ namespace storix::linuxhost {
 
 namespace {
 
-/// The socket and the peer's pidfd.
-constexpr std::size_t descriptorsPerConnection = 2;
+/// The socket, the peer's pidfd, and where the peer may send descriptors, a socket pair and the one that it sent.
+constexpr std::size_t descriptorsPerConnection = 5;
 /// For the daemon's own files, the extensions (a socket, a pidfd and a pipe each), and the files that
 /// clients have proved.
 constexpr std::size_t reservedDescriptors = 512 + Sandbox::proofsAltogether;

@@ -256,7 +256,7 @@ TEST_F(SocketTest, ForeignUserIsDroppedBeforeAByteIsReadWithOneLogLine) {
 
 TEST(ConnectionLimitTest, DescriptorsAreKeptBack) {
   EXPECT_EQ(ConnectionLimit::connectionsFor(1U << 20), 1024U);
-  EXPECT_EQ(ConnectionLimit::connectionsFor(1024), 256U);
+  EXPECT_EQ(ConnectionLimit::connectionsFor(1024), 102U);
   EXPECT_GE(ConnectionLimit::connectionsFor(8), 1U);
 }
 

@@ -18,6 +18,7 @@
 #include "wire/Codec.h"
 #include "wire/PlatformInterfaces.h"
 #include "wire/TestConnection.h"
+#include "wire/SendBytes.h"
 
 namespace storix::linuxhost {
 namespace {
@@ -221,20 +222,8 @@ TEST_F(PlatformSocketTest, ConfinedProcessPostsNothing) {
     const UniqueFd connection = prepared ? connectTo(path) : UniqueFd();
     // Hands its connection over, and stays alive, so that the connection goes on being its own.
     char byte = 'x';
-    iovec content{&byte, 1};
-    alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int))> control{};
-    msghdr message{};
-    message.msg_iov = &content;
-    message.msg_iovlen = 1;
-    message.msg_control = control.data();
-    message.msg_controllen = control.size();
-    cmsghdr *header = CMSG_FIRSTHDR(&message);
-    header->cmsg_level = SOL_SOCKET;
-    header->cmsg_type = SCM_RIGHTS;
-    header->cmsg_len = CMSG_LEN(sizeof(int));
-    const int number = connection.get();
-    std::memcpy(CMSG_DATA(header), &number, sizeof number);
-    const bool sent = ::sendmsg(theirs.get(), &message, 0) == 1;
+    const std::array<int, 1> handedOver{connection.get()};
+    const bool sent = wire::sendBytes(theirs.get(), std::string_view(&byte, 1), handedOver) == 1;
     const ssize_t ended = ::read(waiting.get(), &byte, 1);
     ::_exit(sent && ended == 0 ? 0 : 1);
   }

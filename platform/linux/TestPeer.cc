@@ -23,6 +23,8 @@
 #include <cstring>
 #include <string>
 
+#include "wire/SendBytes.h"
+
 namespace {
 
 constexpr int controlSocket = 3;
@@ -51,22 +53,9 @@ bool connectTo(const char *name) {
 }
 
 void answer(int opened, int error) {
-  unsigned char byte = static_cast<unsigned char>(opened < 0 ? error : 0);
-  iovec content{&byte, 1};
-  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int))> control{};
-  msghdr message{};
-  message.msg_iov = &content;
-  message.msg_iovlen = 1;
-  if (opened >= 0) {
-    message.msg_control = control.data();
-    message.msg_controllen = control.size();
-    cmsghdr *header = CMSG_FIRSTHDR(&message);
-    header->cmsg_level = SOL_SOCKET;
-    header->cmsg_type = SCM_RIGHTS;
-    header->cmsg_len = CMSG_LEN(sizeof(int));
-    std::memcpy(CMSG_DATA(header), &opened, sizeof(int));
-  }
-  ::sendmsg(controlSocket, &message, MSG_NOSIGNAL);
+  const char byte = static_cast<char>(opened < 0 ? error : 0);
+  const std::array<int, 1> passed{opened};
+  (void)storix::wire::sendBytes(controlSocket, std::string_view(&byte, 1), std::span(passed).first(opened < 0 ? 0 : 1));
 }
 
 }  // namespace

@@ -1,5 +1,6 @@
 // What arrives on a socket, byte for byte: the login, the framing and its limit, and messages that nobody
-// made with a library. The first byte says who is talked to and where the bytes begin.
+// made with a library. The first byte says who is talked to, where the bytes begin, and whether a file
+// descriptor comes with them.
 
 #include <fcntl.h>
 #include <poll.h>
@@ -13,6 +14,7 @@
 #include "tests/fuzz/Target.h"
 #include "wire/BusConnection.h"
 #include "wire/PlatformInterfaces.h"
+#include "wire/SendBytes.h"
 
 using storix::Arguments;
 using storix::LinkInterface;
@@ -65,6 +67,16 @@ void callExtension(BusConnection &connection, Calls &calls) {
   }
 }
 
+/// Of the lowest numbers, which the next ones get.
+int openDescriptors() {
+  constexpr int highest = 48;
+  int count = 0;
+  for (int fd = 0; fd < highest; ++fd) {
+    if (::fcntl(fd, F_GETFD) >= 0) ++count;
+  }
+  return count;
+}
+
 void runAll(std::vector<Task> &later) {
   for (std::size_t i = 0; i < later.size(); ++i) {
     const Task task = std::move(later[i]);
@@ -79,8 +91,10 @@ int LLVMFuzzerTestOneInput(const std::uint8_t *bytes, std::size_t size) {
   if (size == 0) return 0;
   const std::uint8_t mode = bytes[0];
   std::string sent = mode % 2 == 1 ? "\0AUTH EXTERNAL\r\nDATA\r\nNEGOTIATE_UNIX_FD\r\nBEGIN\r\n"s : std::string();
+  const std::size_t loginSize = sent.size();
   sent += storix::fuzz::textOf(bytes + 1, size - 1);
 
+  const int openBefore = openDescriptors();
   std::array<int, 2> ends{-1, -1};
   require(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, ends.data()) == 0, "no socket pair");
   const storix::UniqueFd peer(ends[1]);
@@ -111,10 +125,16 @@ int LLVMFuzzerTestOneInput(const std::uint8_t *bytes, std::size_t size) {
     }
     std::string_view unsent = sent;
     bool finished = false;
+    bool passesDescriptor = mode / 16 % 2 == 1;
     // Every turn takes bytes from one side or the other; far more of them than any input needs.
     for (int turn = 0; connection->isOpen(); ++turn) {
       require(turn < 100'000, "the connection comes to no end");
-      const ssize_t count = ::send(peer.get(), unsent.data(), unsent.size(), MSG_NOSIGNAL);
+      const std::size_t sentBefore = sent.size() - unsent.size();
+      const bool isLogin = sentBefore < loginSize;
+      const std::array<int, 1> descriptor{peer.get()};
+      const ssize_t count = sendBytes(peer.get(), isLogin ? unsent.substr(0, loginSize - sentBefore) : unsent,
+                                      std::span(descriptor).first(passesDescriptor && !isLogin ? 1 : 0));
+      if (count > 0 && !isLogin) passesDescriptor = false;
       if (count > 0) unsent.remove_prefix(static_cast<std::size_t>(count));
       if (unsent.empty() && !finished) {
         finished = true;
@@ -129,6 +149,8 @@ int LLVMFuzzerTestOneInput(const std::uint8_t *bytes, std::size_t size) {
     connection->releaseSocket();
   }
   runAll(later);
+  // The peer is still there.
+  require(openDescriptors() == openBefore + 1, "a descriptor is left open");
   require(closed, "nobody heard of the end");
   require(calls.heard == calls.made, "a caller never heard, or twice");
   return 0;

@@ -17,6 +17,8 @@
 #include <string>
 #include <vector>
 
+#include "wire/SendBytes.h"
+
 namespace {
 
 constexpr const char *forgedText = "text\n[FORGED] line\r[FORGED] return\x1b[31m %s %n %@ \u2028[FORGED]\u0085";
@@ -268,21 +270,8 @@ class Provider {
   void descriptors(sd_bus_message *call) const {
     std::uint64_t cookie = 0;
     sd_bus_message_get_cookie(call, &cookie);
-    std::string bytes = replyHeader(static_cast<std::uint32_t>(cookie), 4) + std::string(4, '\0');
-    const std::vector<int> copies(200, fd_);
-    std::vector<char> control(CMSG_SPACE(copies.size() * sizeof(int)));
-    iovec content{bytes.data(), bytes.size()};
-    msghdr message{};
-    message.msg_iov = &content;
-    message.msg_iovlen = 1;
-    message.msg_control = control.data();
-    message.msg_controllen = control.size();
-    cmsghdr *header = CMSG_FIRSTHDR(&message);
-    header->cmsg_level = SOL_SOCKET;
-    header->cmsg_type = SCM_RIGHTS;
-    header->cmsg_len = CMSG_LEN(copies.size() * sizeof(int));
-    std::memcpy(CMSG_DATA(header), copies.data(), copies.size() * sizeof(int));
-    ::sendmsg(fd_, &message, MSG_NOSIGNAL);
+    const std::string bytes = replyHeader(static_cast<std::uint32_t>(cookie), 4) + std::string(4, '\0');
+    (void)storix::wire::sendBytes(fd_, bytes, std::vector<int>(200, fd_));
   }
 
   sd_bus *const bus_;

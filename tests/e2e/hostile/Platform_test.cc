@@ -239,21 +239,6 @@ TEST_F(HostilePlatform, DescriptorThatWasNotSentIsNoArgument) {
   expectHealthy();
 }
 
-TEST_F(HostilePlatform, DescriptorsOnMessagesThatTakeNoneAreClosed) {
-  startWithBystander();
-  {
-    RawClient client = platformClient();
-    for (std::uint32_t serial = 1; serial <= 200; ++serial) {
-      Message post = Message::platform("Notifications", "Post", "s", Body().string("org.sample.x")).numbered(serial);
-      post.fields.push_back({9, {'u', "250"}});
-      ASSERT_TRUE(client.sendWithDescriptors(post.bytes(), client.fd(), 250));
-      const std::optional<RawAnswer> answer = client.readAnswerTo(serial);
-      ASSERT_TRUE(answer) << serial;
-    }
-  }
-  expectHealthy();
-}
-
 TEST_F(HostilePlatform, ProofsOfAConnectionAreLimitedAndEndWithIt) {
   startWithBystander();
   {

@@ -10,6 +10,7 @@
 #include <cstring>
 
 #include "tests/e2e/Process.h"
+#include "wire/SendBytes.h"
 
 namespace storix::e2e {
 
@@ -101,19 +102,7 @@ bool RawClient::send(std::string_view bytes) const {
 
 bool RawClient::sendWithDescriptors(std::string_view bytes, int descriptor, std::size_t count) const {
   const std::vector<int> descriptors(count, descriptor);
-  std::vector<char> control(CMSG_SPACE(count * sizeof(int)));
-  iovec content{const_cast<char *>(bytes.data()), bytes.size()};
-  msghdr message{};
-  message.msg_iov = &content;
-  message.msg_iovlen = 1;
-  message.msg_control = control.data();
-  message.msg_controllen = control.size();
-  cmsghdr *header = CMSG_FIRSTHDR(&message);
-  header->cmsg_level = SOL_SOCKET;
-  header->cmsg_type = SCM_RIGHTS;
-  header->cmsg_len = CMSG_LEN(count * sizeof(int));
-  std::memcpy(CMSG_DATA(header), descriptors.data(), count * sizeof(int));
-  return ::sendmsg(fd(), &message, MSG_NOSIGNAL) == static_cast<ssize_t>(bytes.size());
+  return wire::sendBytes(fd(), bytes, descriptors) == static_cast<ssize_t>(bytes.size());
 }
 
 std::size_t RawClient::offer(std::string_view bytes) const {

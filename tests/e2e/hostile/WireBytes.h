@@ -35,8 +35,9 @@ struct Message {
   std::uint8_t flags = 0;
   std::uint8_t version = 1;
   std::uint32_t serial = 1;
-  /// Fields of the header: their code, their type and their text or number.
-  std::vector<std::pair<std::uint8_t, std::pair<char, std::string>>> fields;
+  /// A field of the header: its code, its type and its text or number.
+  using Field = std::pair<std::uint8_t, std::pair<char, std::string>>;
+  std::vector<Field> fields;
   std::string body;
   std::optional<std::uint32_t> bodyLength;
   std::optional<std::uint32_t> fieldsLength;
