@@ -10,7 +10,7 @@
 #include <cerrno>
 #include <chrono>
 #include <cstring>
-#include <set>
+#include <map>
 #include <utility>
 #include <vector>
 
@@ -22,12 +22,14 @@ namespace storix::linuxhost {
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
-
 /// Accepted in one turn, so that one socket's flood does not keep a thread for itself.
 constexpr int acceptedAtOnce = 16;
 /// When the system has no descriptor or memory left, it is asked again so much later.
 constexpr std::chrono::milliseconds pauseWithoutResources{200};
+/// A login gets 25 seconds, whatever comes meanwhile. One timer looks at all of them, so that connections
+/// that come and go leave none behind: at the sixth look 25 to 30 seconds have passed.
+constexpr std::chrono::seconds timeBetweenLooks{5};
+constexpr int looksAtALogin = 6;
 
 SXError cannotListen(const std::string &path, std::string_view why) {
   return hostError(HostErrorCode::cannotStart,
@@ -80,7 +82,7 @@ struct NamedSocket::State : std::enable_shared_from_this<NamedSocket::State> {
   void add(UniqueFd connection, ConnectionLimit::Place place);
   void pause();
   void goOn();
-  void watchLogins(Clock::time_point next);
+  void watchLogins();
   void checkLogins();
 
   const ServingContext context;
@@ -95,7 +97,8 @@ struct NamedSocket::State : std::enable_shared_from_this<NamedSocket::State> {
   std::mutex mutex;
   // Under the mutex:
   std::unique_ptr<IoLoop::Watch> watch;
-  std::set<std::shared_ptr<ServedConnection>> connections;
+  /// With the number of looks at a login that is not over.
+  std::map<std::shared_ptr<ServedConnection>, int> connections;
   bool loginsAreWatched = false;
   bool ended = false;
 
@@ -158,7 +161,7 @@ void NamedSocket::State::add(UniqueFd connection, ConnectionLimit::Place place) 
   {
     const std::lock_guard lock(mutex);
     if (ended) return;
-    connections.insert(served);
+    connections.emplace(served, 0);
   }
   accepted(served);
   if (!served->isStarted()) {
@@ -166,7 +169,7 @@ void NamedSocket::State::add(UniqueFd connection, ConnectionLimit::Place place) 
     connections.erase(served);
     return;
   }
-  if (const auto deadline = served->bus().wanted().deadline) watchLogins(*deadline);
+  watchLogins();
 }
 
 void NamedSocket::State::pause() {
@@ -179,37 +182,37 @@ void NamedSocket::State::goOn() {
   if (watch) watch->setEvents(EPOLLIN);
 }
 
-void NamedSocket::State::watchLogins(Clock::time_point next) {
+void NamedSocket::State::watchLogins() {
   {
     const std::lock_guard lock(mutex);
     if (ended || std::exchange(loginsAreWatched, true)) return;
   }
-  const auto remaining = std::max(next - Clock::now(), Clock::duration::zero());
-  context.executor.executeAfter(remaining, [weak = weak_from_this()] {
+  context.executor.executeAfter(timeBetweenLooks, [weak = weak_from_this()] {
     if (const auto self = weak.lock()) self->checkLogins();
   });
 }
 
-/// Ends the connections whose login has taken too long.
 void NamedSocket::State::checkLogins() {
-  std::vector<std::shared_ptr<ServedConnection>> open;
+  std::vector<std::shared_ptr<ServedConnection>> tooLong;
+  bool isAnyLeft = false;
   {
     const std::lock_guard lock(mutex);
     loginsAreWatched = false;
-    open.assign(connections.begin(), connections.end());
-  }
-  std::optional<Clock::time_point> next;
-  for (const auto &connection : open) {
-    std::optional<Clock::time_point> deadline = connection->bus().wanted().deadline;
-    if (!deadline) continue;
-    if (*deadline <= Clock::now()) {
-      connection->checkDeadline();
-      // Looked at again, should it be served by something else just now.
-      deadline = Clock::now() + std::chrono::seconds(1);
+    for (auto &[connection, looks] : connections) {
+      if (connection->isLoggedIn()) continue;
+      if (++looks < looksAtALogin) {
+        isAnyLeft = true;
+      } else {
+        tooLong.push_back(connection);
+      }
     }
-    if (!next || *deadline < *next) next = deadline;
   }
-  if (next) watchLogins(*next);
+  for (const auto &connection : tooLong) {
+    sx_default_log().notice("[NOTICE] Ended the connection of pid %d: its login took longer than 25 seconds.",
+                            connection->peer()->processIdentifier());
+    connection->end();
+  }
+  if (isAnyLeft) watchLogins();
 }
 
 Result<std::unique_ptr<NamedSocket>> NamedSocket::open(const ServingContext &context, const RuntimeDirectory &directory,
@@ -242,10 +245,10 @@ NamedSocket::~NamedSocket() {
     watch = std::move(state_->watch);
   }
   watch.reset();
-  std::set<std::shared_ptr<ServedConnection>> open;
+  std::vector<std::shared_ptr<ServedConnection>> open;
   {
     const std::lock_guard lock(state_->mutex);
-    open = state_->connections;
+    for (const auto &[connection, looks] : state_->connections) open.push_back(connection);
   }
   for (const auto &connection : open) connection->end();
   if (state_->madeHere) ::unlinkat(state_->directory.fd(), state_->name.c_str(), 0);

@@ -15,7 +15,8 @@ namespace storix::linuxhost {
 /// and until `serve` whoever connects waits. Owned by the platform object; thread-safe.
 ///
 /// A peer of another user is dropped before a byte is read. At the limit of connections, and when the
-/// system has no descriptors left, those who come wait until there is room again.
+/// system has no descriptors left, those who come wait until there is room again. A connection whose login
+/// is not over in time is ended, so that it does not keep its place.
 class NamedSocket {
  public:
   using Accepted = std::function<void(const std::shared_ptr<ServedConnection> &)>;

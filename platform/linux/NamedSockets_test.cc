@@ -9,12 +9,14 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <array>
 #include <chrono>
 #include <cstring>
 #include <thread>
 
 #include "platform/linux/ApplicationManifests.h"
 #include "platform/linux/ClientListener.h"
+#include "platform/linux/SteppedTime.h"
 #include "platform/linux/TestDirectory.h"
 #include "platform/linux/TestLog.h"
 #include "platform/linux/TestPeers.h"
@@ -64,7 +66,7 @@ class SocketTest : public testing::Test {
   std::unique_ptr<NamedSocket> openSocket(
       const std::string &name = "com.tessel.Storix",
       wire::BusConnection::Descriptors descriptors = wire::BusConnection::Descriptors::refused) {
-    auto opened = NamedSocket::open({pool_, loop_, peers_, limit_}, *directory_, activated_, name, descriptors);
+    auto opened = NamedSocket::open({time_, loop_, peers_, limit_}, *directory_, activated_, name, descriptors);
     if (opened) return std::move(opened.value());
     refusal_ = opened.error().message();
     return nullptr;
@@ -79,6 +81,7 @@ class SocketTest : public testing::Test {
   ActivatedSockets activated_;
   std::string refusal_;
   ThreadPool pool_;
+  SteppedTime time_{pool_};
   IoLoop loop_{pool_};
   PeerTable peers_{std::make_shared<ApplicationManifests>(std::vector<std::string>())};
   ConnectionLimit limit_{3};
@@ -179,6 +182,66 @@ TEST_F(SocketTest, ThoseBeyondTheLimitWaitForAPlace) {
   EXPECT_TRUE(accepted.take());
 }
 
+/// Reads what the other side has to say to a login, until it has said that.
+bool hears(const UniqueFd &socket, const std::string &awaited) {
+  std::string heard;
+  while (heard.find(awaited) == std::string::npos) {
+    pollfd waited{socket.get(), POLLIN, 0};
+    std::array<char, 256> bytes{};
+    const ssize_t count =
+        ::poll(&waited, 1, 60'000) == 1 ? ::recv(socket.get(), bytes.data(), bytes.size(), MSG_DONTWAIT) : 0;
+    if (count <= 0) return false;
+    heard.append(bytes.data(), static_cast<std::size_t>(count));
+  }
+  return true;
+}
+
+TEST_F(SocketTest, LoginsThatAreNotOverInTimeEndTheirConnectionsWithOneLogLineEach) {
+  const auto socket = openSocket();
+  Received<std::shared_ptr<ServedConnection>> accepted;
+  socket->serve([&accepted](const std::shared_ptr<ServedConnection> &connection) {
+    connection->start();
+    accepted.put(connection);
+  });
+  const auto letTimePass = [this] {
+    ASSERT_TRUE(time_.waitForTaskIn(std::chrono::seconds(5)));
+    time_.advance(std::chrono::seconds(5));
+  };
+  const UniqueFd silent = connectTo(pathOf());
+  ASSERT_TRUE(accepted.take());
+  const UniqueFd rejected = connectTo(pathOf());
+  ASSERT_TRUE(accepted.take());
+  ASSERT_EQ(::send(rejected.get(), "", 1, 0), 1);
+  const std::string login = "AUTH EXTERNAL 3939\r\n";
+  for (int i = 0; i < 5; ++i) {
+    ASSERT_EQ(::send(rejected.get(), login.data(), login.size(), 0), static_cast<ssize_t>(login.size()));
+    ASSERT_TRUE(hears(rejected, "REJECTED"));
+    ASSERT_NO_FATAL_FAILURE(letTimePass());
+  }
+  // It comes when the time of the others is nearly over, and has its own.
+  UniqueFd late = connectTo(pathOf());
+  ASSERT_TRUE(accepted.take());
+  EXPECT_THAT(log_.take(), IsEmpty());
+  ASSERT_NO_FATAL_FAILURE(letTimePass());
+  EXPECT_TRUE(isClosedByPeer(silent));
+  EXPECT_TRUE(isClosedByPeer(rejected));
+  const auto line = HasSubstr("[NOTICE] Ended the connection of pid " + std::to_string(::getpid()) +
+                              ": its login took longer than 25 seconds.");
+  EXPECT_THAT(log_.take(), ElementsAre(line, line));
+
+  ASSERT_NO_FATAL_FAILURE(letTimePass());
+  PlainClient client(std::move(late));
+  const auto greets = [&client] {
+    return client.call(client.message("/org/freedesktop/DBus", "org.freedesktop.DBus", "Hello")) != nullptr;
+  };
+  ASSERT_TRUE(greets()) << client.errorText;
+  const UniqueFd next = connectTo(pathOf());
+  ASSERT_TRUE(accepted.take());
+  for (int i = 0; i < 6; ++i) ASSERT_NO_FATAL_FAILURE(letTimePass());
+  EXPECT_TRUE(isClosedByPeer(next));
+  EXPECT_TRUE(greets()) << "who has logged in stays";
+}
+
 TEST_F(SocketTest, BothSocketsShareTheLimit) {
   const auto first = openSocket();
   const auto second = openSocket("com.tessel.Platform");
@@ -233,6 +296,8 @@ TEST_F(SocketTest, ConnectionsWaitWhileNoDescriptorIsLeftWithOneLogLine) {
   EXPECT_EQ(connected, 0);
   EXPECT_THAT(lines, ElementsAre(HasSubstr("[ERROR] Connections to com.tessel.Storix have to wait: ")));
   EXPECT_EQ(acceptedMeanwhile, 0U);
+  ASSERT_TRUE(time_.waitForTaskIn(std::chrono::milliseconds(200)));
+  time_.advance(std::chrono::milliseconds(200));
   EXPECT_TRUE(accepted.take());
   EXPECT_THAT(log_.take(), IsEmpty());
 }

@@ -31,11 +31,14 @@ ServedConnection::ServedConnection(const ServingContext &context, std::shared_pt
 ServedConnection::~ServedConnection() { bus_->releaseSocket(); }
 
 void ServedConnection::start() {
+  bus_->setReadyHandler([weak = weak_from_this()] {
+    if (const auto self = weak.lock()) self->loggedIn_ = true;
+  });
   bus_->setClosedHandler([weak = weak_from_this()](const SXError &) {
     if (const auto self = weak.lock()) (void)self->finish();
   });
   bus_->setWantedChangedHandler([weak = weak_from_this()] {
-    if (const auto self = weak.lock()) self->follow(0);
+    if (const auto self = weak.lock()) self->follow();
   });
   std::unique_lock lock(mutex_);
   started_ = true;
@@ -58,17 +61,15 @@ bool ServedConnection::isStarted() const {
 
 void ServedConnection::serve() {
   bus_->process();
-  follow(0);
+  follow();
 }
 
-void ServedConnection::follow(std::uint32_t extraEvents) {
+void ServedConnection::follow() {
   const std::lock_guard lock(mutex_);
   if (!watch_) return;
   // Even where nothing is to be read, the peer's end is.
-  watch_->setEvents(static_cast<std::uint32_t>(bus_->wanted().events) | EPOLLHUP | extraEvents);
+  watch_->setEvents(static_cast<std::uint32_t>(bus_->wanted().events) | EPOLLHUP);
 }
-
-void ServedConnection::checkDeadline() { follow(EPOLLOUT); }
 
 void ServedConnection::end() {
   bus_->close();

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <atomic>
 #include <condition_variable>
 #include <cstdint>
 #include <functional>
@@ -47,19 +48,17 @@ class ServedConnection : public std::enable_shared_from_this<ServedConnection> {
   /// Once.
   void start();
   [[nodiscard]] bool isStarted() const;
+  [[nodiscard]] bool isLoggedIn() const { return loggedIn_; }
 
   /// Ends it. When this returns no handler of it runs any more; so it is not for those handlers, which
   /// close `bus()` instead.
   void end();
 
-  /// Serves it now, though nothing has come: its login may have taken too long.
-  void checkDeadline();
-
  private:
   ServedConnection(const ServingContext &context, std::shared_ptr<Peer> peer, ConnectionLimit::Place place,
                    std::shared_ptr<wire::BusConnection> bus);
   void serve();
-  void follow(std::uint32_t extraEvents);
+  void follow();
   [[nodiscard]] bool finish();
 
   const ServingContext context_;
@@ -68,6 +67,7 @@ class ServedConnection : public std::enable_shared_from_this<ServedConnection> {
   const ConnectionLimit::Place place_;
   const std::shared_ptr<wire::BusConnection> bus_;
   Ended ended_;
+  std::atomic<bool> loggedIn_ = false;
 
   mutable std::mutex mutex_;
   bool started_ = false;
