@@ -88,6 +88,13 @@ TEST_F(DirectoryWatchesTest, FileInPlaceOfADirectoryIsWatchedByItsParent) {
   EXPECT_TRUE(watches_.readChanges());
 }
 
+TEST_F(DirectoryWatchesTest, LinkToItselfInPlaceOfADirectoryIsWatchedByItsParent) {
+  std::filesystem::create_directory_symlink("d", directory_ / "d");
+  watch(directory_ / "d", "Info.kvs");
+  std::filesystem::remove(directory_ / "d");
+  EXPECT_TRUE(watches_.readChanges());
+}
+
 TEST_F(DirectoryWatchesTest, TheDirectoryItselfCountsWhenItGoes) {
   directory_.makeDirectory("d");
   watch(directory_ / "d", "*.appdex");

@@ -70,7 +70,7 @@ INSTANTIATE_TEST_SUITE_P(
         Misdeed{"CrashInsteadOfAnAnswer", "crash", "was killed by signal 9"},
         Misdeed{"ChildrenLeftBehind", "fork", "exited with status 0"},
         Misdeed{"JunkInsteadOfAnAnswer", "junk", "Ended the connection of extension org.sample.hostile"},
-        Misdeed{"ValuesNestedTooDeep", "deep", "values are nested more than 16 deep"},
+        Misdeed{"ValuesNestedTooDeep", "deep 20", "values are nested more than 16 deep"},
         Misdeed{"KeyThatStandsTwice", "key-twice", "a dictionary has a key twice"},
         Misdeed{"URLThatIsNoneInsideAnError", "bad-url", "Refused the reply to \"StartProvidingItemAtURL\""},
         Misdeed{"DescriptorsWithTheAnswer", "descriptors", "Ended the connection of extension org.sample.hostile"},
@@ -134,13 +134,73 @@ TEST_F(HostileExtensions, URLThatAnExtensionNamesOutsideItsContainerGetsNoToken)
   expectHealthy();
 }
 
-TEST_F(HostileExtensions, BundleThatBecomesALinkIsNotServed) {
-  startWithBystander();
-  std::filesystem::create_directory(session.directory() / "loop");
-  std::filesystem::create_directory_symlink("loop.appdex", session.extensionsDirectory() / "loop.appdex");
+/// An extension answers an error with so many lists inside each other, and the daemon answers the client one
+/// whose underlying error that is.
+class NestedErrors : public HostileExtensions {
+ protected:
+  SXError failureWith(int lists) {
+    startWithBoth("deep " + std::to_string(lists));
+    const Client::Outcome outcome = bystander->startProviding(itemURL(hostile, "item"), hostile, "c");
+    descriptors = descriptorsInUse();
+    return outcome ? *outcome : SXError("nothing failed", 0);
+  }
+
+  /// What stands in the innermost of the lists, and how many there are.
+  static std::pair<Value, int> innermost(const SXError &error) {
+    const SXError *answered = error.underlyingError();
+    if (!answered || !answered->details().contains("key")) return {Value("no details: " + error.message()), 0};
+    const Value *value = &answered->details().at("key");
+    int lists = 0;
+    for (; value->list() && value->list()->size() == 1; ++lists) value = &value->list()->front();
+    return {*value, lists};
+  }
+};
+
+TEST_F(NestedErrors, SixteenDeepReachTheClientWhole) {
+  // Two errors, thirteen lists and the value.
+  EXPECT_EQ(innermost(failureWith(13)), std::pair(Value(true), 13));
+  expectHealthy();
+}
+
+TEST_F(NestedErrors, SeventeenDeepAreCutWithAWord) {
+  EXPECT_EQ(innermost(failureWith(14)), std::pair(Value("(cut: nested too deeply)"), 13));
+  expectHealthy();
+}
+
+TEST_F(NestedErrors, SixteenDeepOfTheExtensionAreReadAndSeventeenRefused) {
+  // One error, the lists and the value.
+  const SXError error = failureWith(14);
+  ASSERT_TRUE(error.underlyingError());
+  EXPECT_EQ(error.underlyingError()->domain(), "org.sample.deep");
+  ASSERT_NO_FATAL_FAILURE(killHostile());
+  instructHostile("deep 15");
+  EXPECT_TRUE(bystander->startProviding(itemURL(hostile, "item"), hostile, "c"));
+  EXPECT_TRUE(daemon->waitForLine("values are nested more than 16 deep"));
+  expectHealthy();
+}
+
+TEST_F(HostileExtensions, BundleThatIsALinkToItselfIsLeftOutWithOneLineAndServedWhenItIsBack) {
+  startWithBoth("never");
+  const std::filesystem::path bundle = session.extensionsDirectory() / "hostile.appdex";
+  const std::filesystem::path aside = session.directory() / "aside";
   std::filesystem::create_directory_symlink("/proc/self/fd", session.extensionsDirectory() / "proc.appdex");
-  ASSERT_NO_FATAL_FAILURE(serveBystander());
-  EXPECT_FALSE(bystander->extendSandbox(*URL::fileURLWithPath("/x"), "loop", "c"));
+  std::filesystem::rename(bundle, aside);
+  std::filesystem::create_directory_symlink("hostile.appdex", bundle);
+  ASSERT_TRUE(daemon->waitForLine("hostile.appdex/Info.kvs”: Too many levels of symbolic links"));
+
+  // Others are found all the same.
+  session.installProvider("org.sample.new");
+  ASSERT_TRUE(daemon->waitForLine("Registered storix provider extension org.sample.new"));
+  EXPECT_FALSE(bystander->extendSandbox(itemURL(hostile, "item"), hostile, "c"));
+  const std::size_t before = daemon->errorLines().size();
+  std::filesystem::remove(bundle);
+  std::filesystem::rename(aside, bundle);
+  ASSERT_TRUE(daemon->waitForLine("Registered storix provider extension org.sample.hostile", before));
+  EXPECT_TRUE(bystander->extendSandbox(itemURL(hostile, "item"), hostile, "c"));
+  EXPECT_EQ(1U, daemon->countLines("Too many levels of symbolic links"));
+  EXPECT_EQ(1U, daemon->countLines("proc.appdex/Info.kvs”: No such file or directory"));
+  // The new provider's process, and the hostile one's, stay for a while.
+  descriptors = descriptorsInUse();
   expectHealthy();
 }
 

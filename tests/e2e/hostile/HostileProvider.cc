@@ -1,5 +1,5 @@
 // A provider that does what it must until it is asked to start providing an item, and then one of many
-// things that it must not. Which one the file "script" in its bundle says, in one word.
+// things that it must not. Which one the file "script" in its bundle says, in one word and perhaps a number.
 
 #include <sys/prctl.h>
 #include <sys/socket.h>
@@ -52,7 +52,8 @@ std::string replyHeader(std::uint32_t replyTo, std::uint32_t bodyLength) {
 
 class Provider {
  public:
-  Provider(sd_bus *bus, int fd, std::string script) : bus_(bus), fd_(fd), script_(std::move(script)) {}
+  Provider(sd_bus *bus, int fd, std::string script, int number)
+      : bus_(bus), fd_(fd), script_(std::move(script)), number_(number) {}
 
   void answer(sd_bus_message *call) {
     const std::string member = sd_bus_message_get_member(call) ? sd_bus_message_get_member(call) : "";
@@ -181,18 +182,18 @@ class Provider {
     sd_bus_message_unref(reply);
   }
 
+  /// An error with so many lists inside each other, in the innermost of which stands a value.
   void deep(sd_bus_message *call) const {
     sd_bus_message *reply = openError(call, "org.sample.deep");
     sd_bus_message_open_container(reply, 'e', "sv");
     sd_bus_message_append(reply, "s", "key");
     sd_bus_message_open_container(reply, 'v', "av");
-    constexpr int levels = 20;
-    for (int i = 0; i < levels; ++i) {
+    for (int i = 0; i < number_; ++i) {
       sd_bus_message_open_container(reply, 'a', "v");
-      sd_bus_message_open_container(reply, 'v', i + 1 < levels ? "av" : "b");
+      sd_bus_message_open_container(reply, 'v', i + 1 < number_ ? "av" : "b");
     }
     sd_bus_message_append(reply, "b", 1);
-    for (int i = 0; i < levels; ++i) {
+    for (int i = 0; i < number_; ++i) {
       sd_bus_message_close_container(reply);
       sd_bus_message_close_container(reply);
     }
@@ -277,6 +278,7 @@ class Provider {
   sd_bus *const bus_;
   const int fd_;
   const std::string script_;
+  const int number_;
 };
 
 int answerCall(sd_bus_message *message, void *provider, sd_bus_error * /*error*/) {
@@ -294,12 +296,13 @@ int main() {
   const char *bundle = std::getenv("STORIX_BUNDLE_PATH");
   std::ifstream script(std::string(bundle ? bundle : ".") + "/script");
   std::string word;
-  script >> word;
+  int count = 0;
+  script >> word >> count;
   if (word == "no-login") return 4;
   if (word == "endless-login") ::pause();
   sd_bus *bus = nullptr;
   if (sd_bus_new(&bus) < 0 || sd_bus_set_fd(bus, fd, fd) < 0 || sd_bus_start(bus) < 0) return 1;
-  Provider provider(bus, fd, word);
+  Provider provider(bus, fd, word, count);
   if (sd_bus_add_filter(bus, nullptr, answerCall, &provider) < 0) return 1;
   for (;;) {
     const int processed = sd_bus_process(bus, nullptr);
