@@ -15,10 +15,12 @@
 namespace storix {
 
 struct ThreadPool::LocalTasks::State {
-  State(Implementation &ofPool, State *around) : pool(ofPool), outer(around) {}
+  State(Implementation &ofPool, State *around, const std::function<void()> *callback)
+      : pool(ofPool), outer(around), whenBlocking(callback) {}
 
   Implementation &pool;
   State *const outer;
+  const std::function<void()> *const whenBlocking;
   std::vector<Task> tasks;
   std::size_t next = 0;  // those before it have run
 };
@@ -176,6 +178,7 @@ ThreadPool::LocalTasks::State *ThreadPool::Implementation::localTasks() const {
 void ThreadPool::Implementation::submitAllLocalTasks() {
   for (LocalTasks::State *state = innermost; state; state = state->outer) {
     for (; state->next < state->tasks.size(); ++state->next) state->pool.submit(std::move(state->tasks[state->next]));
+    if (state->whenBlocking) (*state->whenBlocking)();
   }
 }
 
@@ -220,8 +223,8 @@ void ThreadPool::didUnblock() {
   ++own.working;
 }
 
-ThreadPool::LocalTasks::LocalTasks(ThreadPool &pool)
-    : state_(std::make_unique<State>(*pool.implementation_, Implementation::innermost)) {
+ThreadPool::LocalTasks::LocalTasks(ThreadPool &pool, const std::function<void()> *whenBlocking)
+    : state_(std::make_unique<State>(*pool.implementation_, Implementation::innermost, whenBlocking)) {
   Implementation::innermost = state_.get();
 }
 

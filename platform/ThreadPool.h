@@ -2,6 +2,7 @@
 
 #include <chrono>
 #include <cstddef>
+#include <functional>
 #include <memory>
 
 #include "platform/Executor.h"
@@ -34,7 +35,8 @@ class ThreadPool : public Executor {
   /// submitted to the global queue costs no change of thread.
   class LocalTasks {
    public:
-    explicit LocalTasks(ThreadPool &pool);
+    /// `whenBlocking` (may be null) runs each time that the thread says that it blocks.
+    explicit LocalTasks(ThreadPool &pool, const std::function<void()> *whenBlocking = nullptr);
     ~LocalTasks();
     LocalTasks(const LocalTasks &) = delete;
     LocalTasks &operator=(const LocalTasks &) = delete;

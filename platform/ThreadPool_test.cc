@@ -372,6 +372,21 @@ TEST(LocalTasks, GoToThePoolWhenTheThreadBlocks) {
   EXPECT_TRUE(ran.wait());
 }
 
+TEST(LocalTasks, TellsThatTheThreadBlocksOncePerWait) {
+  ThreadPool pool;
+  int told = 0;
+  const std::function<void()> tell = [&told] { ++told; };
+  const ThreadPool::LocalTasks local(pool, &tell);
+  {
+    const BlockingScope wait(pool);
+    EXPECT_EQ(told, 1);
+    const BlockingScope waitInside(pool);
+    EXPECT_EQ(told, 1);
+  }
+  const BlockingScope nextWait(pool);
+  EXPECT_EQ(told, 2);
+}
+
 TEST(LocalTasks, AreHeldAgainWhenTheWaitIsOver) {
   ThreadPool pool;
   std::thread::id thread;

@@ -139,11 +139,12 @@ std::optional<SXError> ExtensionProcess::openConnection() {
     if (const auto self = weak.lock()) self->followConnection();
   });
   // The login has a time of its own here, so that the connection's deadlines do not matter.
-  connectionWatch_ =
-      surroundings_.loop.watch(connection_->fd(), static_cast<std::uint32_t>(connection_->wanted().events),
-                               [weak = weak_from_this()](std::uint32_t) {
-                                 if (const auto self = weak.lock()) self->connectionIsReadable();
-                               });
+  connectionWatch_ = surroundings_.loop.watch(
+      connection_->fd(), static_cast<std::uint32_t>(connection_->wanted().events),
+      [weak = weak_from_this()](std::uint32_t) {
+        if (const auto self = weak.lock()) self->connectionIsReadable();
+      },
+      IoLoop::Expected::answers);
   if (!connectionWatch_) return posixError(ENOMEM, "watching the connection of the extension " + name_);
   return std::nullopt;
 }

@@ -12,7 +12,7 @@ namespace storix::linuxhost {
 /// share the work: whichever thread waits takes the next ready descriptor and serves it to the end,
 /// while another one waits in its place. So a request costs no change of thread, and a slow one
 /// delays nobody else: when every thread is busy, one more is started, up to a limit. Having served a
-/// descriptor, a thread waits a millisecond for that one alone: who goes on asking is served faster.
+/// descriptor, a thread waits a little for that one alone: who goes on asking is served faster.
 ///
 ///  1. The handler of one watch never runs on two threads at once.
 ///  2. After a watch is destroyed its handler does not start again; the destructor waits for one that
@@ -21,6 +21,11 @@ namespace storix::linuxhost {
 ///     unless the handler blocks.
 class IoLoop {
  public:
+  /// What comes on a descriptor. A thread that waits for a peer that asks may wait for one that answers,
+  /// too, since what is asked and answered in turn needs no second thread. Where the handler of one of
+  /// them blocks (`BlockingScope`), all threads wait for the other again.
+  enum class Expected { requests, answers };
+
   /// Takes what epoll reports (EPOLLIN, EPOLLHUP, ...).
   using Handler = std::function<void(std::uint32_t events)>;
 
@@ -43,7 +48,7 @@ class IoLoop {
 
   /// Level-triggered: calls the handler as long as the descriptor is ready. The descriptor stays the
   /// caller's and must live as long as the watch. Null when the kernel refuses.
-  std::unique_ptr<Watch> watch(int fd, std::uint32_t events, Handler handler);
+  std::unique_ptr<Watch> watch(int fd, std::uint32_t events, Handler handler, Expected expected = Expected::requests);
 
  private:
   struct Implementation;

@@ -8,6 +8,7 @@
 #include <atomic>
 #include <future>
 #include <latch>
+#include <semaphore>
 #include <thread>
 #include <vector>
 
@@ -147,6 +148,107 @@ TEST_F(IoLoopTest, PausedWatchIsNotServedUntilItGoesOn) {
   allowed = true;
   watch->setEvents(EPOLLIN);
   EXPECT_EQ(ran.get_future().wait_for(generous), std::future_status::ready);
+}
+
+TEST_F(IoLoopTest, AThreadThatStaysSeesAtOnceWhatIsWantedOfItsDescriptor) {
+  IoLoop loop(pool_);
+  const UniqueFd event = makeEvent();
+  // Far more than could be seen in time by a thread that looks when it has waited long enough.
+  std::atomic<int> left = 5'000;
+  std::promise<void> allSeen;
+  std::unique_ptr<IoLoop::Watch> watch;
+  watch = loop.watch(event.get(), 0, [&](std::uint32_t) {
+    watch->setEvents(EPOLLIN);
+    if (--left == 0) allSeen.set_value();
+  });
+  std::atomic<bool> over = false;
+  std::thread changing([&] {
+    while (!over) {
+      watch->setEvents(EPOLLOUT);
+      std::this_thread::yield();
+    }
+  });
+  EXPECT_EQ(allSeen.get_future().wait_for(generous), std::future_status::ready);
+  over = true;
+  changing.join();
+  loop.end();
+}
+
+/// A peer that asks, and one that answers as soon as it is asked.
+class AskingAndAnswering {
+ public:
+  /// What the handlers do besides.
+  std::function<void()> asked;
+  std::function<void()> answered;
+
+  explicit AskingAndAnswering(IoLoop &loop)
+      : askingWatch_(loop.watch(asking_.get(), EPOLLIN,
+                                [this](std::uint32_t) {
+                                  lower(asking_);
+                                  asked();
+                                })),
+        answeringWatch_(loop.watch(
+            answering_.get(), EPOLLIN,
+            [this](std::uint32_t) {
+              lower(answering_);
+              answered();
+            },
+            IoLoop::Expected::answers)) {}
+
+  void ask() { raise(asking_); }
+  void answer() { raise(answering_); }
+
+ private:
+  const UniqueFd asking_ = makeEvent();
+  const UniqueFd answering_ = makeEvent();
+  const std::unique_ptr<IoLoop::Watch> askingWatch_;
+  const std::unique_ptr<IoLoop::Watch> answeringWatch_;
+};
+
+TEST_F(IoLoopTest, AnswersAreServedByTheThreadThatStaysWithWhoAsks) {
+  IoLoop loop(pool_);
+  std::promise<void> together;
+  std::thread::id asker;
+  bool over = false;
+  AskingAndAnswering peers(loop);
+  peers.asked = [&] {
+    asker = std::this_thread::get_id();
+    peers.answer();
+  };
+  // The first times another thread may serve it, or the one that stays has waited too long.
+  peers.answered = [&] {
+    if (over) return;
+    over = asker == std::this_thread::get_id();
+    if (over) return together.set_value();
+    peers.ask();
+  };
+  peers.ask();
+  EXPECT_EQ(together.get_future().wait_for(generous), std::future_status::ready);
+}
+
+TEST_F(IoLoopTest, AHandlerThatBlocksHoldsUpNobodyWhomItsThreadStaysWith) {
+  IoLoop loop(pool_);
+  // In turn one that blocks and one that does not, after which a thread may stay with both again.
+  constexpr int lastRound = 201;
+  std::atomic<int> round = 0;
+  std::binary_semaphore answer(0);
+  std::promise<void> done;
+  AskingAndAnswering peers(loop);
+  peers.asked = [&] {
+    const int current = ++round;
+    peers.answer();
+    if (current % 2 == 0) return;
+    const BlockingScope blocking(pool_);
+    EXPECT_TRUE(answer.try_acquire_for(generous));
+    if (current < lastRound) return peers.ask();
+    done.set_value();
+  };
+  peers.answered = [&] {
+    if (round % 2 == 0) return peers.ask();
+    answer.release();
+  };
+  peers.ask();
+  EXPECT_EQ(done.get_future().wait_for(generous), std::future_status::ready);
 }
 
 TEST_F(IoLoopTest, TasksOfAHandlerRunAfterItOnTheSameThread) {
