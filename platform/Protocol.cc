@@ -30,7 +30,7 @@ void LinkInterface::setPermittedKinds(std::set<ValueKind> kinds, std::string_vie
 
 const std::set<ValueKind> *LinkInterface::permittedKinds(std::string_view operationName, std::size_t argumentIndex,
                                                          bool ofReply) const {
-  const auto found = permittedKinds_.find(std::make_tuple(std::string(operationName), argumentIndex, ofReply));
+  const auto found = permittedKinds_.find(std::make_tuple(operationName, argumentIndex, ofReply));
   return found == permittedKinds_.end() ? nullptr : &found->second;
 }
 

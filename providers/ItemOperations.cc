@@ -23,35 +23,52 @@ struct ItemOperation {
   LogFormat<std::optional<Values>..., std::optional<Subject>, Identifier> succeeded;
 };
 
+/// One call of a member, which its callbacks share, so that none of them copies it.
+template <class Subject, class... Values>
+struct ItemCall {
+  const ItemOperation<Subject, Values...> &operation;
+  std::shared_ptr<SXExtensionStorix> provider;
+  std::optional<Subject> subject;
+  CompletionHandler<SXError, Values...> completion;
+
+  void fail(const LogFormat<std::optional<Subject>, std::optional<std::string>, SXError> &line,
+            std::optional<SXError> error) const {
+    sx_default_log().fault(line, subject, provider->identifier(), *error);
+    if (completion) completion(SXPluginOperationFailedError(std::move(error)), std::optional<Values>()...);
+  }
+
+  void succeed(std::optional<Values>... values) const {
+    sx_default_log().debug(operation.succeeded, values..., subject, provider->identifier());
+    if (completion) completion(std::nullopt, std::move(values)...);
+  }
+};
+
 /// What the members have in common. `operation` must live as long as the process.
 template <class Subject, class... Values>
-void perform(const ItemOperation<Subject, Values...> &operation, const std::shared_ptr<SXExtensionStorix> &provider,
+void perform(const ItemOperation<Subject, Values...> &operation, std::shared_ptr<SXExtensionStorix> provider,
              std::optional<Subject> subject, CompletionHandler<SXError, Values...> completion) {
   sx_default_log().debug("[DEBUG] %s", operation.name);
-  provider->performExtensionRequest([provider, &operation, subject = std::move(subject),
-                                     completion = std::move(completion)](std::optional<SXError> error,
-                                                                         const std::shared_ptr<_KTStorixVendor> &vendor,
-                                                                         const CancelRequest &cancelRequest) {
+  using Call = ItemCall<Subject, Values...>;
+  const auto call =
+      std::make_shared<const Call>(Call{operation, std::move(provider), std::move(subject), std::move(completion)});
+  call->provider->performExtensionRequest([call](std::optional<SXError> error,
+                                                 const std::shared_ptr<_KTStorixVendor> &vendor,
+                                                 CancelRequest cancelRequest) {
     if (error) {
       // The request stays as it is: one that failed is not cancelled here.
-      sx_default_log().fault(operation.requestFailed, subject, provider->identifier(), *error);
-      if (completion) completion(SXPluginOperationFailedError(std::move(error)), std::optional<Values>()...);
+      call->fail(call->operation.requestFailed, std::move(error));
       return;
     }
-    operation.send(*vendor, subject,
-                   [provider, &operation, subject, completion, cancelRequest](std::optional<SXError> replyError,
-                                                                              std::optional<Values>... values) {
-                     if (replyError) {
-                       sx_default_log().fault(operation.replyFailed, subject, provider->identifier(), *replyError);
-                       if (completion) {
-                         completion(SXPluginOperationFailedError(std::move(replyError)), std::optional<Values>()...);
-                       }
-                     } else {
-                       sx_default_log().debug(operation.succeeded, values..., subject, provider->identifier());
-                       if (completion) completion(std::nullopt, std::move(values)...);
-                     }
-                     cancelRequest();
-                   });
+    call->operation.send(*vendor, call->subject,
+                         [call, cancelRequest = std::move(cancelRequest)](std::optional<SXError> replyError,
+                                                                          std::optional<Values>... values) {
+                           if (replyError) {
+                             call->fail(call->operation.replyFailed, std::move(replyError));
+                           } else {
+                             call->succeed(std::move(values)...);
+                           }
+                           cancelRequest();
+                         });
   });
 }
 

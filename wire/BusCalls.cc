@@ -62,7 +62,7 @@ class OperationWaiter : public Waiter {
     const MethodDescription &method = interfaceOf(interface_.protocol()).methods[operation_];
     auto read = readArguments(reply, {interface_, row(), method.outSignature, true});
     if (Arguments *values = std::get_if<Arguments>(&read)) {
-      return [handler = std::move(reply_), values = std::move(*values)] { handler(values); };
+      return [handler = std::move(reply_), values = std::move(*values)]() mutable { handler(std::move(values)); };
     }
     MethodFailure refused = std::move(std::get<MethodFailure>(read));
     refused.text = "the answer cannot be read: " + refused.text;

@@ -43,8 +43,19 @@ class InstalledExtension::Connection : public AuxiliaryConnection {
   std::shared_ptr<RemoteObject> remoteProxyWithErrorHandler(ConnectionErrorHandler errorHandler) override {
     const std::shared_ptr<wire::BusConnection> connection = process_->connection();
     if (!connection) return nullptr;
-    return connection->remoteObject(vendorInterface_, [record = record_, request = request_, process = process_,
-                                                       errorHandler = std::move(errorHandler)](const SXError &error) {
+    // Each message that is sent has a copy of the handler.
+    const auto state = std::make_shared<const Failing>(Failing{record_, request_, process_, std::move(errorHandler)});
+    return connection->remoteObject(vendorInterface_, [state](const SXError &error) { state->fail(error); });
+  }
+
+ private:
+  struct Failing {
+    std::weak_ptr<InstalledExtension> record;
+    RequestIdentifier request;
+    Process process;
+    ConnectionErrorHandler errorHandler;
+
+    void fail(const SXError &error) const {
       if (const auto extension = record.lock()) extension->cancelExtensionRequest(request);
       if (!errorHandler) return;
       const std::shared_ptr<wire::BusConnection> used = process->connection();
@@ -53,10 +64,9 @@ class InstalledExtension::Connection : public AuxiliaryConnection {
       } else {
         process->whenCauseIsKnown(errorHandler);
       }
-    });
-  }
+    }
+  };
 
- private:
   const std::weak_ptr<InstalledExtension> record_;
   const RequestIdentifier request_;
   const Process process_;
@@ -125,25 +135,26 @@ std::optional<SXError> InstalledExtension::startProcess() {
 
 /// With the mutex held. The request counts at once; the rest happens on the executor.
 void InstalledExtension::openRequest(const Process &process, BeginHandler completion) {
-  const std::optional<RequestIdentifier> request = newRequestIdentifier();
+  std::optional<RequestIdentifier> request = newRequestIdentifier();
   if (!request) {
     failBegin(std::move(completion), posixError(EIO, "making the identifier of a request"));
     return;
   }
   requests_[*request] = {process, nullptr};
-  executor_.execute([self = shared_from_this(), process, request, completion = std::move(completion)] {
-    const std::shared_ptr<ExtensionSurroundings> surroundings = self->surroundings_.lock();
-    const std::optional<ExtensionContextClass> contextClass =
-        surroundings ? surroundings->contextClass(contextClassName) : std::nullopt;
-    // Without the class there is no connection, and so no context.
-    if (contextClass && contextClass->auxiliaryVendorProtocol && contextClass->make) {
-      std::shared_ptr<ExtensionContext> context = contextClass->make(
-          std::make_shared<Connection>(self, *request, process, contextClass->auxiliaryVendorProtocol()));
-      const std::lock_guard lock(self->mutex_);
-      self->requests_[*request].context = std::move(context);
-    }
-    if (completion) completion(request, std::nullopt);
-  });
+  executor_.execute(
+      [self = shared_from_this(), process, request = std::move(request), completion = std::move(completion)]() mutable {
+        const std::shared_ptr<ExtensionSurroundings> surroundings = self->surroundings_.lock();
+        const std::optional<ExtensionContextClass> contextClass =
+            surroundings ? surroundings->contextClass(contextClassName) : std::nullopt;
+        // Without the class there is no connection, and so no context.
+        if (contextClass && contextClass->auxiliaryVendorProtocol && contextClass->make) {
+          std::shared_ptr<ExtensionContext> context = contextClass->make(
+              std::make_shared<Connection>(self, *request, process, contextClass->auxiliaryVendorProtocol()));
+          const std::lock_guard lock(self->mutex_);
+          self->requests_[*request].context = std::move(context);
+        }
+        if (completion) completion(std::move(request), std::nullopt);
+      });
 }
 
 void InstalledExtension::failBegin(BeginHandler completion, const SXError &error) {
