@@ -2,6 +2,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <netinet/in.h>
+#include <sys/prctl.h>
 #include <sys/un.h>
 
 #include <algorithm>
@@ -332,6 +333,29 @@ TEST_F(ConfinedExtensionTest, EndOfTheHostEndsTheProcess) {
   host_.reset();
   EXPECT_FALSE(hasChildren());
   EXPECT_TRUE(process.waitForExit());
+}
+
+TEST_F(ConfinedExtensionTest, EndOfTheHostWhileASandboxIsMadeLeavesNothingBehind) {
+  // Whatever is left behind comes to this process, so that it can be seen.
+  ASSERT_EQ(::prctl(PR_SET_CHILD_SUBREAPER, 1), 0);
+  install("never-logs-in");
+  // The end comes at different moments after bubblewrap has made its first process, as it happens.
+  for (int i = 0; i < 10; ++i) {
+    platform_->log().take();
+    Later<Begun> begun = beginLater(record());
+    const pid_t process = startedProcess();
+    const auto deadline = std::chrono::steady_clock::now() + 60s;
+    while (childrenOf(process).empty() && std::chrono::steady_clock::now() < deadline) std::this_thread::yield();
+    host_.reset();
+    EXPECT_TRUE(isCode(begun.wait().error, HostErrorCode::hostEnding));
+    pid_t reaped = 0;
+    while ((reaped = ::waitpid(-1, nullptr, WNOHANG)) >= 0 && std::chrono::steady_clock::now() < deadline) {
+      if (reaped == 0) std::this_thread::yield();
+    }
+    ASSERT_LT(reaped, 0) << "a process is left";
+    confine(ConfinementPolicy::preferred);
+  }
+  ::prctl(PR_SET_CHILD_SUBREAPER, 0);
 }
 
 TEST_F(ConfinedExtensionTest, ProgramThatCannotBeRunFailsTheBeginWithItsReason) {

@@ -106,6 +106,19 @@ std::vector<pid_t> confinedProcesses(pid_t process) {
   return first.empty() ? first : childrenOf(first.front());
 }
 
+/// Signals those that are found below that process. False when there was none.
+bool signalAll(std::vector<pid_t> (*find)(pid_t), pid_t process, int signal) {
+  bool isSent = false;
+  for (const pid_t found : find(process)) {
+    const UniqueFd pidfd(static_cast<int>(::syscall(SYS_pidfd_open, found, 0)));
+    // Whoever has got the number meanwhile is in the sandbox too, or is left alone.
+    const std::vector<pid_t> now = find(process);
+    if (!pidfd || std::find(now.begin(), now.end(), found) == now.end()) continue;
+    if (::syscall(SYS_pidfd_send_signal, pidfd.get(), signal, nullptr, 0) == 0) isSent = true;
+  }
+  return isSent;
+}
+
 /// Empty when the process ended well, else what is wrong. An error when nothing can be said.
 Result<std::string> outcomeOf(const LaunchedProcess &process, const std::string &program) {
   pollfd exit{process.pidfd.get(), POLLIN, 0};
@@ -133,16 +146,13 @@ Result<std::string> outcomeOf(const LaunchedProcess &process, const std::string 
 
 }  // namespace
 
-bool signalConfined(pid_t process, int signal) {
-  bool isSent = false;
-  for (const pid_t found : confinedProcesses(process)) {
-    const UniqueFd pidfd(static_cast<int>(::syscall(SYS_pidfd_open, found, 0)));
-    // Whoever has got the number meanwhile is in the sandbox too, or is left alone.
-    const std::vector<pid_t> now = confinedProcesses(process);
-    if (!pidfd || std::find(now.begin(), now.end(), found) == now.end()) continue;
-    if (::syscall(SYS_pidfd_send_signal, pidfd.get(), signal, nullptr, 0) == 0) isSent = true;
-  }
-  return isSent;
+bool signalConfined(pid_t process, int signal) { return signalAll(confinedProcesses, process, signal); }
+
+void killConfined(pid_t process) {
+  // Its first process leaves bubblewrap's group before it is bound to bubblewrap's life, but not before it is
+  // to be seen.
+  (void)signalAll(childrenOf, process, SIGKILL);
+  ::kill(-process, SIGKILL);
 }
 
 struct ExtensionConfinement::Grant {

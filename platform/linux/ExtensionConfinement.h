@@ -16,6 +16,10 @@ namespace storix::linuxhost {
 /// False when there is nothing yet, or it cannot be found out.
 [[nodiscard]] bool signalConfined(pid_t process, int signal);
 
+/// Kills that process, which must be bubblewrap's and not be reaped, and the sandbox, whole or in the making:
+/// bubblewrap that is killed alone while it makes one leaves behind what it has begun.
+void killConfined(pid_t process);
+
 /// What becomes of extensions where bubblewrap is not there, or does not work.
 enum class ConfinementPolicy {
   preferred,  ///< they run with all that their user may do

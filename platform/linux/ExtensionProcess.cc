@@ -257,6 +257,7 @@ void ExtensionProcess::sendSignal(int signal) {
                         signalText(signal));
   // The program itself is asked to end; the end of the one that confines it would kill it.
   if (isConfined_ && signal != SIGKILL && signalConfined(processIdentifier_, signal)) return;
+  if (isConfined_) killConfined(processIdentifier_);
   ::syscall(SYS_pidfd_send_signal, pidfd_.get(), signal, nullptr, 0);
 }
 

@@ -239,6 +239,8 @@ TEST_F(FloodOfAProviderThatHangs, ThousandAndTwentyFourRequestsWaitForItsStartAn
     const RawClient client = serviceClient();
     ASSERT_NO_FATAL_FAILURE(flood(client, 10, 1024 + 60));
     ASSERT_NO_FATAL_FAILURE(expectFailed(60, "1024 requests wait already until the process of the extension"));
+    // A sandbox that is killed in the making leaves something behind.
+    ASSERT_TRUE(daemon->waitForLine("Extension org.sample.hostile: no login"));
   }
   ASSERT_NO_FATAL_FAILURE(killHostile());
   expectHealthy();

@@ -23,6 +23,13 @@ namespace {
 
 constexpr const char *forgedText = "text\n[FORGED] line\r[FORGED] return\x1b[31m %s %n %@ \u2028[FORGED]\u0085";
 
+/// Says in the log that it has come so far, and does nothing more.
+void pauseForEver(const char *line) {
+  std::puts(line);
+  std::fflush(stdout);
+  ::pause();
+}
+
 /// Writes all of it, whoever reads.
 void writeAll(int fd, const char *bytes, std::size_t size) {
   while (size > 0) {
@@ -83,12 +90,7 @@ class Provider {
   void misbehave(sd_bus_message *call) {
     const std::map<std::string, std::function<void()>> misdeeds = {
         {"never", [] {}},
-        {"deaf",
-         [] {
-           std::puts("deaf");
-           std::fflush(stdout);
-           ::pause();
-         }},
+        {"deaf", [] { pauseForEver("deaf"); }},
         {"signature", [&] { sd_bus_reply_method_return(call, "ub", 4711U, 1); }},
         {"two-errors", [&] { twoErrors(call); }},
         {"twice", [&] { twice(call); }},
@@ -299,7 +301,7 @@ int main() {
   int count = 0;
   script >> word >> count;
   if (word == "no-login") return 4;
-  if (word == "endless-login") ::pause();
+  if (word == "endless-login") pauseForEver("no login");
   sd_bus *bus = nullptr;
   if (sd_bus_new(&bus) < 0 || sd_bus_set_fd(bus, fd, fd) < 0 || sd_bus_start(bus) < 0) return 1;
   Provider provider(bus, fd, word, count);
