@@ -95,6 +95,7 @@ TEST_F(ExtensionFailureTest, MessageBeyondThoseThatMayWaitFailsAtOnceAndOthersAr
   const RequestIdentifier refused = beginWell(extension);
   const pid_t process = processOf(extension, silent);
   std::vector<Later<Answer>> waiting;
+  waiting.reserve(4096);
   for (int i = 0; i < 4096; ++i) waiting.push_back(askLater(extension, silent, "silence"));
   const Answer failed = ask(extension, refused, "x");
   ASSERT_TRUE(failed.failure);
@@ -113,6 +114,7 @@ TEST_F(ExtensionFailureTest, MessageBeyondThoseThatMayWaitFailsAtOnceAndOthersAr
 TEST_F(ExtensionFailureTest, BeginBeyondThoseThatMayWaitForTheStartFailsAtOnce) {
   const Record extension = installedRecord("never-logs-in");
   std::vector<Later<Begun>> waiting;
+  waiting.reserve(1024);
   for (int i = 0; i < 1024; ++i) waiting.push_back(beginLater(extension));
   const std::optional<SXError> refused = failureOf(extension);
   EXPECT_TRUE(isCode(refused, HostErrorCode::tooManyRequests));

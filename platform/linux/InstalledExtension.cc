@@ -191,7 +191,12 @@ void InstalledExtension::processFailed(const Process &process, const SXError &er
     const bool wasIdle = failed.empty() && !hasRequests(process);
     if (!wasIdle || isFailureOfIdleProcess(error)) countFailure(error);
   }
-  for (Waiting &waiting : failed) failBegin(std::move(waiting.completion), error);
+  // The process goes with the last of them.
+  for (Waiting &waiting : failed) {
+    executor_.execute([failing = std::move(waiting), error] {
+      if (failing.completion) failing.completion(std::nullopt, error);
+    });
+  }
 }
 
 /// With the mutex held.
