@@ -30,7 +30,11 @@ void LinkInterface::setPermittedKinds(std::set<ValueKind> kinds, std::string_vie
 
 const std::set<ValueKind> *LinkInterface::permittedKinds(std::string_view operationName, std::size_t argumentIndex,
                                                          bool ofReply) const {
-  const auto found = permittedKinds_.find(std::make_tuple(operationName, argumentIndex, ofReply));
+  // There are very few, and looking for a key would copy the name for each argument of each message.
+  const auto found = std::find_if(permittedKinds_.begin(), permittedKinds_.end(),
+                                  [&operationName, &argumentIndex, &ofReply](const auto &declared) {
+                                    return declared.first == std::tie(operationName, argumentIndex, ofReply);
+                                  });
   return found == permittedKinds_.end() ? nullptr : &found->second;
 }
 

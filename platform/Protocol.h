@@ -65,7 +65,7 @@ class LinkInterface {
 
  private:
   const ProtocolDescription *protocol_;
-  std::map<std::tuple<std::string, std::size_t, bool>, std::set<ValueKind>, std::less<>> permittedKinds_;
+  std::map<std::tuple<std::string, std::size_t, bool>, std::set<ValueKind>> permittedKinds_;
 };
 
 /// Takes the answer of an operation. Empty where nobody waits for one.
