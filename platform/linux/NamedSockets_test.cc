@@ -62,6 +62,13 @@ class SocketTest : public testing::Test {
     if (!opened) ADD_FAILURE() << opened.error().message();
     directory_ = std::move(opened.value());
   }
+  ~SocketTest() override {
+    // What still runs asks for the time.
+    loop_.end();
+    pool_.end();
+  }
+  SocketTest(const SocketTest &) = delete;
+  SocketTest &operator=(const SocketTest &) = delete;
 
   std::unique_ptr<NamedSocket> openSocket(
       const std::string &name = "com.tessel.Storix",
