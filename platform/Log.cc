@@ -1,5 +1,6 @@
 #include "platform/Log.h"
 
+#include <algorithm>
 #include <charconv>
 #include <cstdint>
 #include <cstdio>
@@ -97,12 +98,14 @@ std::string shortDescription(const SXError &error) {
 }  // namespace
 
 bool isUTF8(std::string_view text) {
-  while (!text.empty()) {
+  for (;;) {
+    const auto *const unusual = std::find_if(text.begin(), text.end(), [](char c) { return (c & 0x80) != 0; });
+    text.remove_prefix(static_cast<std::size_t>(unusual - text.begin()));
+    if (text.empty()) return true;
     const std::size_t length = firstCharacter(text).length;
     if (length == 0) return false;
     text.remove_prefix(length);
   }
-  return true;
 }
 
 std::string escapedForLog(std::string_view text) {

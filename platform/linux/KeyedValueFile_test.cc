@@ -58,6 +58,20 @@ mode_t modeOf(const std::string &path) {
   return status.st_mode & 07777;
 }
 
+// The writer takes many characters at once where it can.
+TEST(KeyedValueText, WhatIsWrittenInItsOwnWayStandsAnywhereInAText) {
+  for (const std::string special : {"\"", "\\", "\x01", "é", "\x7F"}) {
+    for (std::size_t before = 0; before < 36; ++before) {
+      for (const std::size_t after : {0U, 1U, 15U, 16U, 33U}) {
+        const std::string text = std::string(before, 'a') + special + std::string(after, 'b');
+        EXPECT_EQ(parsed(textOf({{text, text}})), (Dictionary{{text, text}})) << before << ", " << after;
+      }
+      EXPECT_THAT(textOf({{"a", std::string(before, 'a') + "\xE2\x82" + std::string(36, 'b')}}),
+                  HasSubstr("is not UTF-8"));
+    }
+  }
+}
+
 TEST(KeyedValueText, EveryKindIsReadBackAsItWasWritten) {
   const Dictionary content{{"text", "é “quoted” \"x\" \\ \n \x01"},
                            {"zero", std::string("a\0b", 3)},

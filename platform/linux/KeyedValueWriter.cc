@@ -1,3 +1,14 @@
+// The writer copies sixteen bytes at a time, where the processor can. Programs with both kinds of writer
+// keep them apart by the name.
+#if defined(__SSE2__)
+#define RAPIDJSON_SSE2
+#elif defined(__ARM_NEON)
+#define RAPIDJSON_NEON
+#endif
+#define RAPIDJSON_NAMESPACE wide_rapidjson
+#define RAPIDJSON_NAMESPACE_BEGIN namespace wide_rapidjson {
+#define RAPIDJSON_NAMESPACE_END }
+
 #include <fcntl.h>
 #include <rapidjson/stringbuffer.h>
 #include <rapidjson/writer.h>
@@ -9,6 +20,7 @@
 #include <cmath>
 #include <cstdio>
 
+#include "platform/Log.h"
 #include "platform/linux/KeyedValueFile.h"
 #include "platform/linux/PathText.h"
 #include "wire/UniqueFd.h"
@@ -16,8 +28,7 @@
 namespace storix::linuxhost {
 namespace {
 
-using Writer = rapidjson::Writer<rapidjson::StringBuffer, rapidjson::UTF8<>, rapidjson::UTF8<>, rapidjson::CrtAllocator,
-                                 rapidjson::kWriteValidateEncodingFlag>;
+namespace rapidjson = wide_rapidjson;
 
 /// Writes values as text; on the first that cannot be written `problem` says why, and all ends.
 class TextWriter {
@@ -30,9 +41,8 @@ class TextWriter {
     }
     writer_.StartObject();
     for (const auto &[key, value] : dictionary) {
-      if (!writer_.Key(key.data(), static_cast<rapidjson::SizeType>(key.size()))) {
-        return refuse("the key " + quotedPath(key) + " is not UTF-8");
-      }
+      if (!isUTF8(key)) return refuse("the key " + quotedPath(key) + " is not UTF-8");
+      writer_.Key(key.data(), static_cast<rapidjson::SizeType>(key.size()));
       if (!write(value)) return false;
     }
     writer_.EndObject();
@@ -63,8 +73,8 @@ class TextWriter {
 
   bool write(const Value &value) {
     if (const std::string *text = value.string()) {
-      return writer_.String(text->data(), static_cast<rapidjson::SizeType>(text->size())) ||
-             refuse("the string " + quotedPath(*text) + " is not UTF-8");
+      if (!isUTF8(*text)) return refuse("the string " + quotedPath(*text) + " is not UTF-8");
+      return writer_.String(text->data(), static_cast<rapidjson::SizeType>(text->size()));
     }
     if (const Dictionary *dictionary = value.dictionary()) return write(*dictionary);
     if (const List *list = value.list()) return write(*list);
@@ -76,7 +86,8 @@ class TextWriter {
     return refuse("a value of the kind " + std::string(valueKindName(value.kind())) + " cannot be written");
   }
 
-  Writer writer_;
+  // The one that is made for sixteen bytes at a time; it does not look whether they are UTF-8.
+  rapidjson::Writer<rapidjson::StringBuffer> writer_;
   std::size_t level_ = 0;
   std::string problem_;
 };
