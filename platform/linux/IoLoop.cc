@@ -72,6 +72,8 @@ struct Entry {
 struct Place {
   UniqueFd wake;
   bool isTaken = false;
+  /// Whether its thread runs a handler, so that it would not notice what is added, however long that takes.
+  bool isServing = false;
   std::vector<std::shared_ptr<Entry>> entries;
 };
 
@@ -234,7 +236,7 @@ bool IoLoop::Implementation::add(Place &place, const std::shared_ptr<Entry> &ent
 bool IoLoop::Implementation::joinWhoAsks(const std::shared_ptr<Entry> &entry) {
   if (entry->expected != Expected::answers) return false;
   for (Place &place : places) {
-    if (place.entries.size() != 1 || place.entries.front()->expected != Expected::requests) continue;
+    if (place.isServing || place.entries.size() != 1 || place.entries.front()->expected != Expected::requests) continue;
     if (!add(place, entry)) return false;
     eventfd_write(place.wake.get(), 1);
     return true;
@@ -253,6 +255,7 @@ void IoLoop::Implementation::stayAt(Place &place) {
     nfds_t count = 1;
     {
       const std::lock_guard lock(mutex);
+      place.isServing = false;
       if (place.entries.size() == 1 && joinWhoAsks(place.entries.front())) place.entries.clear();
       std::erase_if(place.entries, [&place, &waited, &polled, &count](const std::shared_ptr<Entry> &entry) {
         const std::lock_guard entryLock(entry->mutex);
@@ -267,6 +270,10 @@ void IoLoop::Implementation::stayAt(Place &place) {
     if (::poll(waited.data(), count, stayingMilliseconds) <= 0) break;
     eventfd_t wakes = 0;
     if (waited[0].revents != 0) eventfd_read(place.wake.get(), &wakes);
+    {
+      const std::lock_guard lock(mutex);
+      place.isServing = true;
+    }
     for (nfds_t i = 1; i < count; ++i) {
       if (waited[i].revents == 0) continue;
       Entry &entry = *polled[i];
@@ -289,7 +296,7 @@ void IoLoop::Implementation::stayAt(Place &place) {
   }
   leave(place, nullptr);
   const std::lock_guard lock(mutex);
-  place.isTaken = false;
+  place.isTaken = place.isServing = false;
 }
 
 /// Has epoll wait for what the thread stays with.
