@@ -19,6 +19,9 @@ class Executor {
   /// As `execute`, once the delay has passed. Never earlier.
   virtual void executeAfter(std::chrono::nanoseconds delay, Task task) = 0;
 
+  /// The time by which delays are counted.
+  [[nodiscard]] virtual std::chrono::steady_clock::time_point now() const { return std::chrono::steady_clock::now(); }
+
   /// A task that is about to wait for something says so, and says when the wait is over, so that the
   /// executor can have another thread work meanwhile. Use `BlockingScope`.
   virtual void willBlock() {}

@@ -35,6 +35,11 @@ void ManualExecutor::executeAfter(std::chrono::nanoseconds delay, Task task) {
   delayed_.insert(later, {due, std::move(task)});
 }
 
+std::chrono::steady_clock::time_point ManualExecutor::now() const {
+  const std::lock_guard lock(mutex_);
+  return std::chrono::steady_clock::time_point(now_);
+}
+
 bool ManualExecutor::runOne() {
   std::unique_lock lock(mutex_);
   if (ready_.empty()) return false;

@@ -23,6 +23,8 @@ class ManualExecutor : public Executor {
   void execute(Task task) override;
   void executeAfter(std::chrono::nanoseconds delay, Task task) override;
 
+  [[nodiscard]] std::chrono::steady_clock::time_point now() const override;
+
   [[nodiscard]] bool hasThreads() const override { return false; }
 
   /// Runs the task that has waited longest; false when there is none.

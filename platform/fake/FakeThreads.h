@@ -34,6 +34,9 @@ class FakeExecutor : public Executor {
 
   void execute(Task task) override;
   void executeAfter(std::chrono::nanoseconds delay, Task task) override;
+  [[nodiscard]] std::chrono::steady_clock::time_point now() const override {
+    return manual_ ? manual_->now() : threads_->now();
+  }
   void willBlock() override;
   void didUnblock() override;
   [[nodiscard]] bool hasThreads() const override { return !manual_; }

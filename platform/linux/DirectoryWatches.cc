@@ -16,9 +16,7 @@ constexpr std::uint32_t watchedEvents = IN_CREATE | IN_DELETE | IN_MOVED_FROM | 
                                         IN_ATTRIB | IN_DELETE_SELF | IN_MOVE_SELF | IN_ONLYDIR;
 
 /// Its parent tells when it comes, or when its permissions change.
-bool isWatchedByParent(int error) {
-  return error == ENOENT || error == ENOTDIR || error == EACCES || error == ELOOP;
-}
+bool isWatchedByParent(int error) { return error == ENOENT || error == ENOTDIR || error == EACCES || error == ELOOP; }
 
 }  // namespace
 

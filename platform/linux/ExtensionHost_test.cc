@@ -116,6 +116,29 @@ TEST_F(ExtensionHostTest, NewRequestWithinTheIdleTimeKeepsTheProcess) {
   EXPECT_EQ(processOf(extension, beginWell(extension)), process) << "the idle time begins anew";
 }
 
+TEST_F(ExtensionHostTest, IdleTimeCountsFromTheLastOfSeveralRequests) {
+  const Record extension = installedRecord("answers");
+  RequestIdentifier request = beginWell(extension);
+  const Watched process(processOf(extension, request));
+  extension->cancelExtensionRequest(request);
+  time_.advance(6s);
+  request = beginWell(extension);
+  extension->cancelExtensionRequest(request);
+  time_.advance(4s);
+  ASSERT_TRUE(time_.waitForTaskIn(6s));
+  EXPECT_TRUE(process.isRunning());
+  time_.advance(6s);
+  EXPECT_TRUE(process.waitForExit());
+}
+
+TEST_F(ExtensionHostTest, OneTaskWaitsForTheIdleTimeHoweverManyRequestsEnd) {
+  const Record extension = installedRecord("answers");
+  extension->cancelExtensionRequest(beginWell(extension));
+  const std::size_t waiting = time_.delayedCount();
+  for (int i = 0; i < 100; ++i) extension->cancelExtensionRequest(beginWell(extension));
+  EXPECT_EQ(time_.delayedCount(), waiting);
+}
+
 TEST_F(ExtensionHostTest, ProcessThatOutlivesItsConnectionGetsTheTerminationSignal) {
   const Record extension = installedRecord("stays");
   const RequestIdentifier request = beginWell(extension);

@@ -94,7 +94,6 @@ void InstalledExtension::beginExtensionRequest(BeginHandler completion) {
   std::optional<SXError> error;
   {
     const std::lock_guard lock(mutex_);
-    ++useCount_;
     if (!process_ || !process_->isUsable()) error = startProcess();
     if (!error && isReady_) {
       openRequest(process_, std::move(completion));
@@ -235,16 +234,30 @@ void InstalledExtension::cancelExtensionRequest(const RequestIdentifier &request
   ended = std::move(found->second);
   requests_.erase(found);
   if (ended.process != process_ || hasRequests(process_)) return;
-  executor_.executeAfter(idleTime, [weak = weak_from_this(), useCount = useCount_] {
-    if (const auto self = weak.lock()) self->endIfIdle(useCount);
+  idleSince_ = executor_.now();
+  if (!std::exchange(idlenessIsWatched_, true)) watchIdleness(idleTime);
+}
+
+/// With the mutex held. One task waits for all requests that end meanwhile, however many.
+void InstalledExtension::watchIdleness(std::chrono::nanoseconds time) {
+  executor_.executeAfter(time, [weak = weak_from_this()] {
+    if (const auto self = weak.lock()) self->endIfIdle();
   });
 }
 
-void InstalledExtension::endIfIdle(unsigned long useCount) {
+void InstalledExtension::endIfIdle() {
   Process idle;
   {
     const std::lock_guard lock(mutex_);
-    if (useCount != useCount_) return;
+    idlenessIsWatched_ = false;
+    // Whoever uses it or waits for it says so again at the end.
+    if (!process_ || !isReady_ || hasRequests(process_)) return;
+    const std::chrono::nanoseconds left = idleSince_ + idleTime - executor_.now();
+    if (left > std::chrono::nanoseconds::zero()) {
+      idlenessIsWatched_ = true;
+      watchIdleness(left);
+      return;
+    }
     idle = std::exchange(process_, nullptr);
     isReady_ = false;
   }

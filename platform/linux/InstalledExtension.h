@@ -93,7 +93,8 @@ class InstalledExtension : public ExtensionRecord, public std::enable_shared_fro
   void processFailed(const Process &process, const SXError &error);
   [[nodiscard]] std::vector<Waiting> takeWaiting(const Process &process);
   void countFailure(const SXError &error);
-  void endIfIdle(unsigned long useCount);
+  void watchIdleness(std::chrono::nanoseconds time);
+  void endIfIdle();
   [[nodiscard]] bool hasRequests(const Process &process) const;
 
   const std::shared_ptr<const ExtensionBundle> bundle_;
@@ -106,8 +107,9 @@ class InstalledExtension : public ExtensionRecord, public std::enable_shared_fro
   bool isReady_ = false;
   std::vector<Waiting> waiting_;
   std::map<RequestIdentifier, Request> requests_;
-  /// Goes up with each request, so that the idle time begins anew.
-  unsigned long useCount_ = 0;
+  /// When the last request ended, and whether a task waits for the end of the idle time.
+  std::chrono::steady_clock::time_point idleSince_;
+  bool idlenessIsWatched_ = false;
   int recentFailures_ = 0;
   /// Goes up when the failures so far count no more.
   unsigned long failureRound_ = 0;

@@ -27,6 +27,17 @@ class SteppedTime : public Executor {
     changed_.notify_all();
   }
 
+  [[nodiscard]] std::chrono::steady_clock::time_point now() const override {
+    const std::lock_guard lock(mutex_);
+    return std::chrono::steady_clock::time_point(now_);
+  }
+
+  /// How many tasks wait for their time.
+  [[nodiscard]] std::size_t delayedCount() const {
+    const std::lock_guard lock(mutex_);
+    return delayed_.size();
+  }
+
   /// Waits until a task is to run in just that time; false when none comes.
   [[nodiscard]] bool waitForTaskIn(std::chrono::nanoseconds delay) {
     std::unique_lock lock(mutex_);
@@ -58,7 +69,7 @@ class SteppedTime : public Executor {
   };
 
   Executor &executor_;
-  std::mutex mutex_;
+  mutable std::mutex mutex_;
   std::condition_variable changed_;
   std::chrono::nanoseconds now_{0};
   std::vector<Delayed> delayed_;
