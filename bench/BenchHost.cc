@@ -5,7 +5,7 @@
 #include <mutex>
 #include <utility>
 
-#include "platform/linux/DirectoryRelationship.h"
+#include "platform/linux/files/DirectoryRelationship.h"
 #include "providers/_KTStorixVendor.h"
 
 namespace storix::bench {

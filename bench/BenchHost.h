@@ -7,7 +7,7 @@
 
 #include "platform/PlatformServices.h"
 #include "platform/ThreadPool.h"
-#include "platform/linux/Files.h"
+#include "platform/linux/files/Files.h"
 
 namespace storix::bench {
 

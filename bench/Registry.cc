@@ -13,7 +13,7 @@
 #include "bench/Benchmarks.h"
 #include "bench/Scene.h"
 #include "platform/ProcessScope.h"
-#include "platform/linux/ExtensionBundles.h"
+#include "platform/linux/extensions/ExtensionBundles.h"
 #include "providers/SXExtensionStorix.h"
 
 namespace storix::bench {

@@ -19,7 +19,7 @@
 #include <thread>
 
 #include "bench/Measure.h"
-#include "platform/linux/KeyedValueFile.h"
+#include "platform/linux/files/KeyedValueFile.h"
 
 namespace storix::bench {
 

@@ -10,7 +10,7 @@
 
 #include "platform/linux/HostErrors.h"
 #include "platform/linux/LogSinks.h"
-#include "platform/linux/PathText.h"
+#include "platform/linux/files/PathText.h"
 
 namespace storix::linuxhost {
 

@@ -7,8 +7,8 @@
 
 #include "platform/Log.h"
 #include "platform/Result.h"
-#include "platform/linux/ExtensionBundles.h"
-#include "platform/linux/ExtensionConfinement.h"
+#include "platform/linux/extensions/ExtensionBundles.h"
+#include "platform/linux/extensions/ExtensionConfinement.h"
 
 namespace storix::linuxhost {
 

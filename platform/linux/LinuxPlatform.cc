@@ -4,13 +4,13 @@
 
 #include <utility>
 
-#include "platform/linux/ApplicationManifests.h"
-#include "platform/linux/ClientListener.h"
-#include "platform/linux/DirectoryRelationship.h"
 #include "platform/linux/HostErrors.h"
 #include "platform/linux/LogSinks.h"
-#include "platform/linux/PathText.h"
-#include "platform/linux/PlatformSocket.h"
+#include "platform/linux/files/DirectoryRelationship.h"
+#include "platform/linux/files/PathText.h"
+#include "platform/linux/identity/ApplicationManifests.h"
+#include "platform/linux/sockets/ClientListener.h"
+#include "platform/linux/sockets/PlatformSocket.h"
 
 namespace storix::linuxhost {
 

@@ -5,7 +5,7 @@
 
 #include "platform/Log.h"
 #include "platform/PlatformServices.h"
-#include "platform/linux/KeyedValueFile.h"
+#include "platform/linux/files/KeyedValueFile.h"
 
 namespace storix::linuxhost {
 

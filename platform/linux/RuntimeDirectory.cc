@@ -14,7 +14,7 @@
 #include <cstring>
 
 #include "platform/linux/HostErrors.h"
-#include "platform/linux/PathText.h"
+#include "platform/linux/files/PathText.h"
 
 namespace storix::linuxhost {
 

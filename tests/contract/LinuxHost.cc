@@ -5,9 +5,9 @@
 #include <filesystem>
 #include <utility>
 
-#include "platform/linux/KeyedValueFile.h"
 #include "platform/linux/LinuxPlatform.h"
 #include "platform/linux/TestDirectory.h"
+#include "platform/linux/files/KeyedValueFile.h"
 #include "tests/contract/HostUnderTest.h"
 
 namespace storix::contract {

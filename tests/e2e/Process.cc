@@ -22,6 +22,7 @@ struct Pipe {
 Pipe makePipe() {
   int ends[2] = {-1, -1};
   EXPECT_EQ(0, ::pipe2(ends, O_CLOEXEC)) << std::strerror(errno);
+  EXPECT_EQ(0, ::fcntl(ends[0], F_SETFL, O_NONBLOCK)) << std::strerror(errno);
   return {UniqueFd(ends[0]), UniqueFd(ends[1])};
 }
 
@@ -59,15 +60,15 @@ Process::Process(std::vector<std::string> arguments, const Environment &environm
   if (error != 0) {
     processIdentifier_ = -1;
     status_ = 127;
-    openPipes_ = 0;
     ADD_FAILURE() << "cannot start " << arguments[0] << ": " << std::strerror(error);
     return;
   }
   pidfd_.reset(static_cast<int>(::syscall(SYS_pidfd_open, processIdentifier_, 0)));
-  outputPipe_ = std::move(output.reading);
-  errorPipe_ = std::move(errors.reading);
-  outputReader_ = std::thread([this] { collect(outputPipe_.get(), outputLines_); });
-  errorReader_ = std::thread([this] { collect(errorPipe_.get(), errorLines_); });
+  output_.pipe = std::move(output.reading);
+  errors_.pipe = std::move(errors.reading);
+  output_.open = errors_.open = true;
+  outputReader_ = std::thread([this] { collect(output_); });
+  errorReader_ = std::thread([this] { collect(errors_); });
 }
 
 Process::~Process() {
@@ -79,25 +80,35 @@ Process::~Process() {
   if (errorReader_.joinable()) errorReader_.join();
 }
 
-void Process::collect(int fd, std::vector<std::string> &lines) {
-  std::string pending;
-  char buffer[4096];
+void Process::collect(Printed &printed) {
   for (;;) {
-    const ssize_t count = ::read(fd, buffer, sizeof buffer);
-    if (count < 0 && errno == EINTR) continue;
+    pollfd waited{printed.pipe.get(), POLLIN, 0};
+    ::poll(&waited, 1, -1);
     const std::lock_guard lock(mutex_);
+    take(printed);
+    changed_.notify_all();
+    if (!printed.open) return;
+  }
+}
+
+/// With the mutex held: all that the program has printed by now.
+void Process::take(Printed &printed) {
+  char buffer[4096];
+  while (printed.open) {
+    const ssize_t count = ::read(printed.pipe.get(), buffer, sizeof buffer);
+    if (count < 0 && errno == EINTR) continue;
+    if (count < 0 && errno == EAGAIN) return;
+    std::string &pending = printed.pending;
     if (count <= 0) {
-      if (!pending.empty()) lines.push_back(pending);
-      --openPipes_;
-      changed_.notify_all();
+      if (!pending.empty()) printed.lines.push_back(std::move(pending));
+      printed.open = false;
       return;
     }
     pending.append(buffer, static_cast<std::size_t>(count));
     for (std::size_t end = pending.find('\n'); end != std::string::npos; end = pending.find('\n')) {
-      lines.push_back(pending.substr(0, end));
+      printed.lines.push_back(pending.substr(0, end));
       pending.erase(0, end + 1);
     }
-    changed_.notify_all();
   }
 }
 
@@ -129,7 +140,7 @@ int Process::wait() {
     reap();
   }
   std::unique_lock lock(mutex_);
-  changed_.wait_for(lock, deadline, [this] { return openPipes_ == 0; });
+  changed_.wait_for(lock, deadline, [this] { return !output_.open && !errors_.open; });
   return status_.value_or(-1);
 }
 
@@ -137,32 +148,34 @@ std::optional<std::size_t> Process::waitForLine(const std::string &text, std::si
   std::unique_lock lock(mutex_);
   std::size_t next = from;
   const auto found = [&] {
-    for (; next < errorLines_.size(); ++next) {
-      if (errorLines_[next].find(text) != std::string::npos) return true;
+    for (; next < errors_.lines.size(); ++next) {
+      if (errors_.lines[next].find(text) != std::string::npos) return true;
     }
     return false;
   };
-  if (changed_.wait_for(lock, deadline, [&] { return found() || openPipes_ == 0; }) && next < errorLines_.size()) {
+  if (changed_.wait_for(lock, deadline, [&] { return found() || (!output_.open && !errors_.open); }) &&
+      next < errors_.lines.size()) {
     return next;
   }
-  ADD_FAILURE() << "no line with “" << text << "” among:\n" << joined(errorLines_);
+  ADD_FAILURE() << "no line with “" << text << "” among:\n" << joined(errors_.lines);
   return std::nullopt;
 }
 
-std::vector<std::string> Process::errorLines() const {
+std::vector<std::string> Process::errorLines() {
   const std::lock_guard lock(mutex_);
-  return errorLines_;
+  take(errors_);
+  return errors_.lines;
 }
 
-std::string Process::output() const {
+std::string Process::output() {
   const std::lock_guard lock(mutex_);
-  return joined(outputLines_);
+  take(output_);
+  return joined(output_.lines);
 }
 
-std::size_t Process::countLines(const std::string &text) const {
-  const std::lock_guard lock(mutex_);
+std::size_t Process::countLines(const std::string &text) {
   std::size_t count = 0;
-  for (const std::string &line : errorLines_) count += line.find(text) != std::string::npos ? 1 : 0;
+  for (const std::string &line : errorLines()) count += line.find(text) != std::string::npos ? 1 : 0;
   return count;
 }
 

@@ -45,28 +45,33 @@ class Process {
   /// that line's index; none, and a failed test, when the program ends or the deadline passes first.
   std::optional<std::size_t> waitForLine(const std::string &text, std::size_t from = 0);
 
-  /// The lines so far. After `wait`, all of them.
-  [[nodiscard]] std::vector<std::string> errorLines() const;
-  [[nodiscard]] std::string output() const;
+  /// All that it has printed by now: what it printed before anything that the test has seen of it is there.
+  [[nodiscard]] std::vector<std::string> errorLines();
+  [[nodiscard]] std::string output();
 
-  /// The number of lines so far that contain the text.
-  [[nodiscard]] std::size_t countLines(const std::string &text) const;
+  /// The number of those lines of stderr that contain the text.
+  [[nodiscard]] std::size_t countLines(const std::string &text);
 
  private:
   void reap();
-  void collect(int fd, std::vector<std::string> &lines);
+  /// What it prints to stdout or stderr.
+  struct Printed {
+    UniqueFd pipe;
+    bool open = false;
+    std::string pending;
+    std::vector<std::string> lines;
+  };
+  void collect(Printed &printed);
+  static void take(Printed &printed);
 
   pid_t processIdentifier_ = -1;
   UniqueFd pidfd_;
-  UniqueFd outputPipe_;
-  UniqueFd errorPipe_;
   std::optional<int> status_;
 
-  mutable std::mutex mutex_;
+  std::mutex mutex_;
   std::condition_variable changed_;
-  int openPipes_ = 2;
-  std::vector<std::string> outputLines_;
-  std::vector<std::string> errorLines_;
+  Printed output_;
+  Printed errors_;
 
   std::thread outputReader_;
   std::thread errorReader_;

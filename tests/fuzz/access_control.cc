@@ -1,7 +1,7 @@
 // The file with the grants: what is understood answers questions, and can be changed and written.
 
 #include "access/AccessControlMap.h"
-#include "platform/linux/KeyedValueFile.h"
+#include "platform/linux/files/KeyedValueFile.h"
 #include "tests/fuzz/Target.h"
 
 using storix::AccessControlMap;

@@ -1,7 +1,7 @@
 // .flatpak-info: the text by which a sandbox says who is in it.
 
 #include "platform/Log.h"
-#include "platform/linux/FlatpakInfo.h"
+#include "platform/linux/identity/FlatpakInfo.h"
 #include "tests/fuzz/Target.h"
 
 using storix::fuzz::require;

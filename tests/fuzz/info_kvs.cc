@@ -1,6 +1,6 @@
 // Info.kvs, and all that is taken from it before the bundle's program runs.
 
-#include "platform/linux/ExtensionBundles.h"
+#include "platform/linux/extensions/ExtensionBundles.h"
 #include "tests/fuzz/FuzzDirectory.h"
 #include "tests/fuzz/Target.h"
 

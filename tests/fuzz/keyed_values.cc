@@ -1,6 +1,6 @@
 // Keyed-value text: what is understood can be written, and reads back as the same.
 
-#include "platform/linux/KeyedValueFile.h"
+#include "platform/linux/files/KeyedValueFile.h"
 #include "tests/fuzz/Target.h"
 
 using storix::Dictionary;

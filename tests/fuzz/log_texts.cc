@@ -1,7 +1,7 @@
 // Texts from outside on their way into the log, and what an extension writes to its output.
 
 #include "platform/Log.h"
-#include "platform/linux/OutputLines.h"
+#include "platform/linux/extensions/OutputLines.h"
 #include "tests/fuzz/Target.h"
 
 using storix::fuzz::require;

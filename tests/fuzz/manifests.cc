@@ -2,7 +2,7 @@
 
 #include <sys/stat.h>
 
-#include "platform/linux/ApplicationManifests.h"
+#include "platform/linux/identity/ApplicationManifests.h"
 #include "tests/fuzz/FuzzDirectory.h"
 #include "tests/fuzz/Target.h"
 

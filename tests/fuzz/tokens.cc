@@ -1,6 +1,6 @@
 // Tokens: nothing that was not sealed here is a token, and what was sealed reads as it was.
 
-#include "platform/linux/Tokens.h"
+#include "platform/linux/identity/Tokens.h"
 #include "tests/fuzz/FuzzDirectory.h"
 #include "tests/fuzz/Target.h"
 

@@ -1,6 +1,6 @@
 // Names of systemd units and the text of /proc/<pid>/cgroup, a name of which the process may choose.
 
-#include "platform/linux/UnitNames.h"
+#include "platform/linux/identity/UnitNames.h"
 #include "tests/fuzz/Target.h"
 
 using storix::fuzz::require;

@@ -3,7 +3,7 @@
 #include <memory>
 #include <string>
 
-#include "platform/linux/ExtensionBundles.h"
+#include "platform/linux/extensions/ExtensionBundles.h"
 #include "tools/check-extension/Findings.h"
 
 namespace storix::check {

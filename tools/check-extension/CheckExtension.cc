@@ -6,9 +6,9 @@
 #include <system_error>
 #include <utility>
 
-#include "platform/linux/ExtensionBundles.h"
-#include "platform/linux/ExtensionConfinement.h"
 #include "platform/linux/HostEnvironment.h"
+#include "platform/linux/extensions/ExtensionBundles.h"
+#include "platform/linux/extensions/ExtensionConfinement.h"
 #include "tools/check-extension/CheckBadInput.h"
 #include "tools/check-extension/CheckBundle.h"
 #include "tools/check-extension/CheckItem.h"

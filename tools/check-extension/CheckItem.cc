@@ -16,7 +16,7 @@
 #include <vector>
 
 #include "platform/SXError.h"
-#include "platform/linux/KeyedValueFile.h"
+#include "platform/linux/files/KeyedValueFile.h"
 #include "tools/check-extension/CheckBadInput.h"
 #include "wire/UniqueFd.h"
 

@@ -18,7 +18,7 @@
 #include <utility>
 
 #include "platform/linux/HostErrors.h"
-#include "platform/linux/OutputLines.h"
+#include "platform/linux/extensions/OutputLines.h"
 #include "providers/_KTStorixVendor.h"
 
 namespace storix::check {

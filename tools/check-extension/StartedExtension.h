@@ -15,7 +15,7 @@
 #include <vector>
 
 #include "platform/Result.h"
-#include "platform/linux/ExtensionLauncher.h"
+#include "platform/linux/extensions/ExtensionLauncher.h"
 #include "sdk/src/BusLoop.h"
 
 namespace storix::check {

@@ -4,7 +4,7 @@
 #include <utility>
 
 #include "access/AccessControlMap.h"
-#include "platform/linux/KeyedValueFile.h"
+#include "platform/linux/files/KeyedValueFile.h"
 #include "tools/storixctl/Advice.h"
 #include "tools/storixctl/Table.h"
 

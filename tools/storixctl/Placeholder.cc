@@ -5,7 +5,7 @@
 
 #include <string>
 
-#include "platform/linux/KeyedValueFile.h"
+#include "platform/linux/files/KeyedValueFile.h"
 #include "wire/UniqueFd.h"
 
 namespace storix::ctl {
