@@ -1,10 +1,17 @@
 #include "storix/ProviderExtension.h"
 
+#include <fcntl.h>
+#include <linux/openat2.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
 #include <cerrno>
 #include <cstdlib>
 #include <filesystem>
 #include <system_error>
 #include <utility>
+
+#include "wire/UniqueFd.h"
 
 namespace storix {
 
@@ -32,6 +39,33 @@ std::optional<std::string> below(const std::string &directory, const std::string
   }
   std::string rest = path.substr(directory.size() + 1);
   return hasPlainComponents(rest) ? std::optional(std::move(rest)) : std::nullopt;
+}
+
+/// Whether the path leads nowhere but below the directory, as far as there is anything: the kernel tells
+/// in one look, whatever comes and goes meanwhile.
+bool staysBelow(const std::string &directory, const std::string &path) {
+  const UniqueFd from(::open(directory.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  if (!from) return false;
+  open_how how{};
+  how.flags = O_PATH | O_CLOEXEC;
+  how.resolve = RESOLVE_BENEATH | RESOLVE_NO_MAGICLINKS;
+  for (;;) {
+    const UniqueFd there(static_cast<int>(::syscall(SYS_openat2, from.get(), path.c_str(), &how, sizeof how)));
+    if (there) return true;
+    if (errno != EINTR && errno != EAGAIN) return errno == ENOENT;
+  }
+}
+
+/// As `std::filesystem::weakly_canonical`, which fails when something that it has seen is gone before it
+/// has resolved it.
+std::filesystem::path resolvedAsFarAsThere(const std::string &path, std::error_code &failed) {
+  constexpr int mostTries = 100;
+  std::filesystem::path resolved;
+  for (int tries = 0; tries < mostTries; ++tries) {
+    resolved = std::filesystem::weakly_canonical(path, failed);
+    if (failed != std::errc::no_such_file_or_directory) break;
+  }
+  return resolved;
 }
 
 }  // namespace
@@ -83,12 +117,13 @@ std::optional<std::string> ProviderExtension::relativePath(const URL &url) const
   const auto directory = providedItemsURL();
   if (!directory) return std::nullopt;
   auto asItStands = below(directory->path(), url.path());
+  if (asItStands && staysBelow(directory->path(), *asItStands)) return asItStands;
   std::error_code failed;
   const auto resolvedDirectory = std::filesystem::canonical(directory->path(), failed);
   // A directory that is not there yet holds no link.
   if (failed == std::errc::no_such_file_or_directory) return asItStands;
   if (failed) return std::nullopt;
-  const auto resolved = std::filesystem::weakly_canonical(url.path(), failed);
+  const auto resolved = resolvedAsFarAsThere(url.path(), failed);
   if (failed) return std::nullopt;
   auto resolvedPath = below(resolvedDirectory.string(), resolved.string());
   return resolvedPath && asItStands ? asItStands : resolvedPath;

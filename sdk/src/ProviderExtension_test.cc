@@ -9,6 +9,7 @@
 #include <condition_variable>
 #include <cstdlib>
 #include <filesystem>
+#include <fstream>
 #include <future>
 #include <mutex>
 #include <stdexcept>
@@ -130,6 +131,26 @@ TEST_F(ProviderExtensionTest, RelativePathsStayInside) {
   EXPECT_EQ(extension_->relativePath(item("a/../../secret")), std::nullopt);
   EXPECT_EQ(extension_->relativePath(item("")), std::nullopt);
   EXPECT_EQ(extension_->relativePath(*URL::fileURLWithPath(directory_ + "/group/Storix Storage 2/a")), std::nullopt);
+}
+
+TEST_F(ProviderExtensionTest, RelativePathsAreFoundWhileTheirFilesComeAndGo) {
+  const std::string storage = directory_ + "/group/Storix Storage";
+  fs::create_directory(storage);
+  fs::create_symlink(directory_, directory_ + "/link");
+  const std::string linked = directory_ + "/link/group/Storix Storage/a";
+  std::atomic<bool> over = false;
+  std::thread changing([&storage, &over] {
+    while (!over) {
+      std::ofstream(storage + "/a") << "x";
+      fs::remove(storage + "/a");
+    }
+  });
+  for (int i = 0; i < 2'000; ++i) {
+    if (extension_->relativePath(item("a")) != "a") ADD_FAILURE() << "as it stands";
+    if (extension_->relativePath(*URL::fileURLWithPath(linked)) != "a") ADD_FAILURE() << "through a link";
+  }
+  over = true;
+  changing.join();
 }
 
 TEST_F(ProviderExtensionTest, RelativePathsFollowNoLinkOut) {
