@@ -88,9 +88,7 @@ Result<Claims::ConnectionPointer> Claims::connect() {
                   bus.setClosedHandler([weak, added](const SXError &) {
                     const auto self = weak.lock();
                     const auto closed = added.lock();
-                    if (!self || !closed) return;
-                    if (self->start_) self->start_->forget();
-                    self->drop(closed);
+                    if (self && closed) self->lose(closed);
                   });
                 });
   if (!opened) return opened.error();
@@ -141,7 +139,7 @@ void Claims::endNow(const std::shared_ptr<Claim> &claim, EndHandler handler) {
                           const auto *failure = std::get_if<wire::MethodFailure>(&result);
                           if (failure && failure->name == wire::busErrorName::disconnected) {
                             // All of its claims are lost, this one among them.
-                            if (const auto closed = claim->connection.lock()) self->drop(closed);
+                            if (const auto closed = claim->connection.lock()) self->lose(closed);
                             return pending->finish(claimLostError());
                           }
                           if (claim->state == Claim::State::ending) claim->state = Claim::State::ended;
@@ -162,6 +160,12 @@ void Claims::release(const std::shared_ptr<Claim> &claim) {
                       std::count_if(connections_.begin(), connections_.end(), isIdle) > std::ptrdiff_t{idleConnections};
   const bool unwanted = connection->givenUp > 0 && connection->givenUp == connection->claims.size();
   if (enough || unwanted) drop(connection);
+}
+
+/// The daemon has ended it. A message that cannot be sent may tell before the connection itself does.
+void Claims::lose(const ConnectionPointer &connection) {
+  if (start_) start_->forget();
+  drop(connection);
 }
 
 void Claims::drop(const ConnectionPointer &connection) {

@@ -88,6 +88,7 @@ class Claims : public std::enable_shared_from_this<Claims> {
   void giveUp(const std::shared_ptr<Claim> &claim);
   void endNow(const std::shared_ptr<Claim> &claim, EndHandler handler);
   void release(const std::shared_ptr<Claim> &claim);
+  void lose(const ConnectionPointer &connection);
   void drop(const ConnectionPointer &connection);
 
   const std::shared_ptr<RequestThread> thread_;
