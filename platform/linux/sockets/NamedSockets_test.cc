@@ -279,8 +279,9 @@ TEST_F(SocketTest, ConnectionsWaitWhileNoDescriptorIsLeftWithOneLogLine) {
   ASSERT_TRUE(accepted.take());
   sx_default_log().fault("[ERROR] %@: %@", pathOf(), posixError(EMFILE, "accept"));
   Received<bool> passed;
-  Executor &executor = pool_;
+  Executor &executor = time_;
   executor.executeAfter(std::chrono::milliseconds(1), [&passed] { passed.put(true); });
+  time_.advance(std::chrono::milliseconds(1));
   ASSERT_TRUE(passed.take());
   log_.take();
 
