@@ -7,17 +7,20 @@
 #include <mutex>
 #include <vector>
 
-#include "platform/Executor.h"
+#include "platform/ThreadPool.h"
 
 namespace storix::linuxhost {
 
-/// An executor for tests: tasks run at once on another executor, but time stands still until the test
-/// moves it. Thread-safe.
+/// An executor for tests: tasks run at once on a pool, but time stands still until the test moves it.
+/// With it the pool ends, since what still runs there may ask for the time. Thread-safe.
 class SteppedTime : public Executor {
  public:
-  explicit SteppedTime(Executor &executor) : executor_(executor) {}
+  explicit SteppedTime(ThreadPool &pool) : pool_(pool) {}
+  ~SteppedTime() override { pool_.end(); }
+  SteppedTime(const SteppedTime &) = delete;
+  SteppedTime &operator=(const SteppedTime &) = delete;
 
-  void execute(Task task) override { executor_.execute(std::move(task)); }
+  void execute(Task task) override { pool_.execute(std::move(task)); }
 
   void executeAfter(std::chrono::nanoseconds delay, Task task) override {
     {
@@ -59,7 +62,7 @@ class SteppedTime : public Executor {
       delayed_.erase(later, delayed_.end());
     }
     std::stable_sort(due.begin(), due.end(), [](const Delayed &a, const Delayed &b) { return a.due < b.due; });
-    for (Delayed &delayed : due) executor_.execute(std::move(delayed.task));
+    for (Delayed &delayed : due) pool_.execute(std::move(delayed.task));
   }
 
  private:
@@ -68,7 +71,7 @@ class SteppedTime : public Executor {
     Task task;
   };
 
-  Executor &executor_;
+  ThreadPool &pool_;
   mutable std::mutex mutex_;
   std::condition_variable changed_;
   std::chrono::nanoseconds now_{0};

@@ -101,6 +101,13 @@ class Watched {
 class ExtensionHostTest : public ::testing::Test {
  protected:
   ExtensionHostTest() { makeHost(true); }
+  ~ExtensionHostTest() override {
+    host_.reset();
+    loop_.end();
+    pool_.end();
+  }
+  ExtensionHostTest(const ExtensionHostTest &) = delete;
+  ExtensionHostTest &operator=(const ExtensionHostTest &) = delete;
 
   void makeHost(bool withContextClass, std::unique_ptr<ExtensionConfinement> confinement = nullptr) {
     host_.reset();

@@ -288,6 +288,7 @@ void ExtensionProcess::takeOutput(std::size_t limit) {
 }
 
 void ExtensionProcess::reapIfExited() {
+  UniqueFd pidfd;
   std::unique_ptr<IoLoop::Watch> exitWatch;
   std::unique_ptr<IoLoop::Watch> outputWatch;
   std::optional<SXError> cause;
@@ -304,7 +305,9 @@ void ExtensionProcess::reapIfExited() {
     state_ = State::ending;
     exitWatch = std::move(exitWatch_);
     outputWatch = std::move(outputWatch_);
-    pidfd_.reset();
+    // Where somebody who waits for the exit has taken the watch, it is still at it: then the descriptor stays as
+    // long as this object.
+    if (exitWatch) pidfd = std::move(pidfd_);
     execFailure_.reset();
     socket_.reset();
     // What it has answered is still read; then the connection ends, even if a process that it has
