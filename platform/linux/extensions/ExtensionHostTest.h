@@ -102,6 +102,7 @@ class ExtensionHostTest : public ::testing::Test {
  protected:
   ExtensionHostTest() { makeHost(true); }
   ~ExtensionHostTest() override {
+    // What still runs asks for the time, and watches.
     host_.reset();
     loop_.end();
     pool_.end();
