@@ -13,6 +13,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <thread>
 #include <vector>
 
@@ -215,18 +216,24 @@ class ExtensionHostTest : public ::testing::Test {
 
   static std::optional<SXError> failureOf(const Record &record) { return begin(record).error; }
 
-  /// The process of the extension that was started, as the log tells.
-  pid_t startedProcess() {
-    const std::string beginning = "[INFO] Started process ";
+  /// The first line of the log that holds the text, once it is there; else none.
+  std::string waitForLine(std::string_view text) {
     const auto deadline = std::chrono::steady_clock::now() + 60s;
     while (std::chrono::steady_clock::now() < deadline) {
       for (const std::string &line : platform_->log().texts()) {
-        if (line.starts_with(beginning)) return static_cast<pid_t>(std::stol(line.substr(beginning.size())));
+        if (line.find(text) != std::string::npos) return line;
       }
       std::this_thread::yield();
     }
-    ADD_FAILURE() << "no process was started";
-    return 0;
+    ADD_FAILURE() << "no line with: " << text;
+    return {};
+  }
+
+  /// The process of the extension that was started, as the log tells.
+  pid_t startedProcess() {
+    const std::string beginning = "[INFO] Started process ";
+    const std::string line = waitForLine(beginning);
+    return line.empty() ? 0 : static_cast<pid_t>(std::stol(line.substr(beginning.size())));
   }
 
   /// Ends the last request of an idle process that goes on: its connection is closed after ten seconds,

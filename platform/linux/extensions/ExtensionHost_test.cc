@@ -10,6 +10,8 @@
 
 #include <array>
 #include <csignal>
+#include <cstdlib>
+#include <future>
 
 #include "platform/linux/extensions/ExtensionHostTest.h"
 #include "platform/linux/extensions/ExtensionLauncher.h"
@@ -245,6 +247,18 @@ TEST_F(ExtensionHostTest, EndOfTheHostKillsWhatDoesNotEnd) {
   const Record extension = installedRecord("ignores-termination");
   static_cast<void>(beginWell(extension));
   host_.reset();
+  EXPECT_FALSE(hasChildren());
+}
+
+TEST_F(ExtensionHostTest, EndOfTheHostReapsAProcessThatADebuggerHeldAfterItsEnd) {
+  const Record extension = installedRecord("answers");
+  const std::string tracer = textFor(extension, beginWell(extension), "be-traced");
+  ASSERT_NE(std::atoi(tracer.c_str()), 0) << tracer;
+  auto ended = std::async(std::launch::async, [this] { host_.reset(); });
+  // The process has gone at the first signal, but cannot be reaped, and so gets the second one too.
+  static_cast<void>(waitForLine("with signal 9"));
+  ::kill(std::atoi(tracer.c_str()), SIGKILL);
+  ended.wait();
   EXPECT_FALSE(hasChildren());
 }
 

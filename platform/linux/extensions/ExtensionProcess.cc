@@ -9,10 +9,12 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <csignal>
 #include <cstring>
+#include <thread>
 #include <utility>
 
 #include "platform/Log.h"
@@ -287,18 +289,18 @@ void ExtensionProcess::takeOutput(std::size_t limit) {
   if (outputWatch_) outputWatch_->setEvents(0);
 }
 
-void ExtensionProcess::reapIfExited() {
+bool ExtensionProcess::reapIfExited() {
   UniqueFd pidfd;
   std::unique_ptr<IoLoop::Watch> exitWatch;
   std::unique_ptr<IoLoop::Watch> outputWatch;
   std::optional<SXError> cause;
   {
     const std::lock_guard lock(mutex_);
-    if (isGone_ || !pidfd_) return;
+    if (isGone_ || !pidfd_) return true;
     siginfo_t information{};
     const int waited = ::waitid(P_PIDFD, static_cast<id_t>(pidfd_.get()), &information, WEXITED | WNOHANG);
-    if (waited == 0 && information.si_pid == 0) return;
-    if (waited != 0 && errno == EINTR) return;
+    if (waited != 0 && errno == EINTR) return false;
+    if (waited == 0 && information.si_pid == 0) return false;
     isGone_ = true;
     // Where somebody else has reaped it there is nothing more to know than that it is gone.
     cause = exitCause(waited == 0 ? information.si_code : CLD_EXITED, waited == 0 ? information.si_status : 0);
@@ -325,6 +327,7 @@ void ExtensionProcess::reapIfExited() {
   sx_default_log().info("[INFO] %@", cause->message());
   settle(*cause, true);
   if (handlers_.gone) handlers_.gone(shared_from_this());
+  return true;
 }
 
 SXError ExtensionProcess::exitCause(int code, int status) const {
@@ -404,20 +407,21 @@ bool ExtensionProcess::waitForExit(std::chrono::milliseconds time) {
   }
   // From here on no other thread reaps it, so that the descriptor stays.
   exitWatch.reset();
-  pollfd waiting{};
-  {
-    const std::lock_guard lock(mutex_);
-    if (isGone_ || !pidfd_) return true;
-    waiting = {pidfd_.get(), POLLIN, 0};
-  }
   const auto deadline = std::chrono::steady_clock::now() + time;
   for (;;) {
-    const auto left = std::chrono::ceil<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
-    const int ready = ::poll(&waiting, 1, static_cast<int>(std::max(left.count(), std::int64_t{0})));
-    if (ready < 0 && errno == EINTR) continue;
-    if (ready <= 0) return false;
-    reapIfExited();
-    return true;
+    pollfd waiting{};
+    {
+      const std::lock_guard lock(mutex_);
+      if (isGone_ || !pidfd_) return true;
+      waiting = {pidfd_.get(), POLLIN, 0};
+    }
+    const auto left =
+        std::max(std::chrono::ceil<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now()),
+                 std::chrono::milliseconds::zero());
+    const int ready = ::poll(&waiting, 1, static_cast<int>(left.count()));
+    if (ready > 0 && reapIfExited()) return true;
+    if (left == std::chrono::milliseconds::zero()) return false;
+    if (ready > 0) std::this_thread::sleep_for(std::min(left, timeUntilReaped));
   }
 }
 

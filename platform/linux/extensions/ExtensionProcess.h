@@ -35,6 +35,8 @@ class ExtensionProcess : public std::enable_shared_from_this<ExtensionProcess> {
   static constexpr std::chrono::seconds timeUntilSignal{5};
   /// How long after the end of its connection the reason, an exit most often, is waited for.
   static constexpr std::chrono::seconds timeUntilExit{1};
+  /// At the daemon's end: how often it is tried to reap one that has exited, but that a debugger holds.
+  static constexpr std::chrono::milliseconds timeUntilReaped{10};
   /// Messages that it has not answered yet. Sixteen clients with all that they may have in flight; and as
   /// requests that want no answer count nowhere else, what a process that hangs can cost the daemon.
   static constexpr std::size_t messagesWaitingAtMost = 4096;
@@ -98,7 +100,8 @@ class ExtensionProcess : public std::enable_shared_from_this<ExtensionProcess> {
   void loginTimeIsOver();
   void outputIsReadable();
   void takeOutput(std::size_t limit);
-  void reapIfExited();
+  /// Whether it is gone. A debugger can hold it for a while after its exit.
+  bool reapIfExited();
   [[nodiscard]] SXError exitCause(int code, int status) const;
   void closeConnectionAndEscalate();
   void sendSignal(int signal);
