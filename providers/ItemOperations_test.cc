@@ -1,4 +1,5 @@
 #include <functional>
+#include <ostream>
 
 #include "providers/ProvidersTest.h"
 
@@ -25,6 +26,8 @@ struct Member {
   std::string requestFailed;
   std::string replyFailed;
   std::string succeeded;
+
+  friend void PrintTo(const Member &member, std::ostream *out) { *out << member.name; }
 };
 
 Argument argument(std::optional<SXError> error) { return error ? Argument(*std::move(error)) : Argument(); }

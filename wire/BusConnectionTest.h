@@ -9,6 +9,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <ostream>
 #include <string>
 #include <thread>
 #include <vector>
@@ -113,12 +114,17 @@ class BusConnectionTest : public testing::Test {
   std::optional<TestConnection> client_;
 };
 
+/// Names a test's parameter.
+inline void PrintTo(const BusConnection::Descriptors &descriptors, std::ostream *out) {
+  *out << (descriptors == BusConnection::Descriptors::passed ? "WithDescriptors" : "WithoutDescriptors");
+}
+
 /// Run with each way in which what the peer sends is cut into messages.
 class EachFramingTest : public BusConnectionTest, public testing::WithParamInterface<BusConnection::Descriptors> {
  public:
   static auto each() { return testing::Values(Descriptors::refused, Descriptors::passed); }
   static std::string name(const testing::TestParamInfo<Descriptors> &tested) {
-    return tested.param == Descriptors::passed ? "WithDescriptors" : "WithoutDescriptors";
+    return testing::PrintToString(tested.param);
   }
 
  protected:
