@@ -255,8 +255,7 @@ TEST_F(ExtensionFailureTest, ProcessThatLeavesWhileItHasNothingToDoDoesNotCountA
     const pid_t process = processOf(extension, request);
     const Watched watched(process);
     extension->cancelExtensionRequest(request);
-    ASSERT_EQ(::kill(process, SIGUSR1), 0);
-    EXPECT_TRUE(watched.waitForExit());
+    watched.endWith(SIGUSR1);
     waitUntilReaped(process);
   }
 }
