@@ -69,7 +69,7 @@ wire::OwnedMessage BusClient::request(const char *method, const std::vector<std:
 }
 
 wire::OwnedMessage BusClient::exchange(const char *method, const wire::OwnedMessage &message) {
-  sd_bus_error error = SD_BUS_ERROR_NULL;
+  sd_bus_error error{};
   sd_bus_message *reply = nullptr;
   const int result = sd_bus_call(bus_.get(), message.get(), 0, &error, &reply);
   if (result < 0) giveUp(std::string(method) + ": " + (error.message ? error.message : std::strerror(-result)));

@@ -76,7 +76,7 @@ class PeerBus {
   /// Waits until somebody has that name.
   void awaitName(const char *name) const {
     for (int tries = 0; tries < 3000; ++tries) {
-      sd_bus_error error = SD_BUS_ERROR_NULL;
+      sd_bus_error error{};
       sd_bus_message *reply = nullptr;
       const int found = sd_bus_call_method(bus(), "org.freedesktop.DBus", "/org/freedesktop/DBus",
                                            "org.freedesktop.DBus", "GetNameOwner", &error, &reply, "s", name);
@@ -92,7 +92,7 @@ class PeerBus {
   template <class... Values>
   wire::OwnedMessage call(const char *member, const char *types, Values... values) const {
     const bool ofStore = std::strncmp(member, "Documents.", 10) != 0;
-    sd_bus_error error = SD_BUS_ERROR_NULL;
+    sd_bus_error error{};
     sd_bus_message *reply = nullptr;
     const int result = sd_bus_call_method(
         bus(), ofStore ? "org.freedesktop.impl.portal.PermissionStore" : "org.freedesktop.portal.Documents",

@@ -39,6 +39,7 @@ void write(const fs::path &file, const std::string &content) {
 
 std::vector<char *> pointers(std::vector<std::string> &texts) {
   std::vector<char *> all;
+  all.reserve(texts.size() + 1);
   for (std::string &text : texts) all.push_back(text.data());
   all.push_back(nullptr);
   return all;
@@ -60,6 +61,7 @@ fs::path placeOnDisk() {
 Program::Program(std::vector<std::string> arguments, const std::map<std::string, std::string> &environment,
                  const fs::path &output) {
   std::vector<std::string> variables;
+  variables.reserve(environment.size());
   for (const auto &[name, value] : environment) variables.push_back(name + "=" + value);
   const std::vector<char *> argv = pointers(arguments);
   const std::vector<char *> envp = pointers(variables);

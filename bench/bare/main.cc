@@ -118,7 +118,7 @@ struct Backend {
 };
 
 int callBackend(sd_bus *bus, const char *member, const char *url) {
-  sd_bus_error error = SD_BUS_ERROR_NULL;
+  sd_bus_error error{};
   sd_bus_message *reply = nullptr;
   const int result =
       sd_bus_call_method(bus, nullptr, vendorPath, vendorInterface, member, &error, &reply, "as", 1, url);

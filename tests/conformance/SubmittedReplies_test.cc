@@ -14,7 +14,7 @@ struct SubmittedReplyCase {
   Arguments arguments;
   Dictionary entitlements;
 
-  friend void PrintTo(const SubmittedReplyCase &request, std::ostream *out) { *out << request.label; }
+  friend void PrintTo(const SubmittedReplyCase &replyCase, std::ostream *out) { *out << replyCase.label; }
 };
 
 // What a request answers by itself goes to the global queue after the line about it is in the log, so

@@ -114,7 +114,8 @@ TEST_F(CoordinatedTools, ADocumentIsReadAndWrittenByItsBookmark) {
 }
 
 TEST_F(CoordinatedTools, ALargeDocumentPassesWhole) {
-  std::string content(20'000'003, 'x');
+  std::string content;
+  content.resize(20'000'003, 'x');
   for (std::size_t i = 0; i < content.size(); i += 101) content[i] = static_cast<char>(i);
   session.write(source() / "film", content);
   installFolderProvider();
