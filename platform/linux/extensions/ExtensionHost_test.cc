@@ -250,6 +250,20 @@ TEST_F(ExtensionHostTest, EndOfTheHostKillsWhatDoesNotEnd) {
   EXPECT_FALSE(hasChildren());
 }
 
+TEST_F(ExtensionHostTest, AProcessThatADebuggerHoldsAfterItsEndIsReapedWhenItLetsGo) {
+  const Record extension = installedRecord("answers");
+  const RequestIdentifier request = beginWell(extension);
+  const std::string tracer = textFor(extension, request, "be-traced");
+  ASSERT_NE(std::atoi(tracer.c_str()), 0) << tracer;
+  const pid_t process = processOf(extension, request);
+  const Watched watched(process);
+  Later<Answer> leaving = askLater(extension, request, "leave");
+  EXPECT_TRUE(watched.waitForExit());
+  ::kill(std::atoi(tracer.c_str()), SIGKILL);
+  EXPECT_TRUE(isCode(leaving.wait().failure, HostErrorCode::extensionExited));
+  waitUntilReaped(process);
+}
+
 TEST_F(ExtensionHostTest, EndOfTheHostReapsAProcessThatADebuggerHeldAfterItsEnd) {
   const Record extension = installedRecord("answers");
   const std::string tracer = textFor(extension, beginWell(extension), "be-traced");

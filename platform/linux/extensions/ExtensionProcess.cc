@@ -6,6 +6,7 @@
 #include <sys/epoll.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>
+#include <sys/timerfd.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -293,6 +294,7 @@ bool ExtensionProcess::reapIfExited() {
   UniqueFd pidfd;
   std::unique_ptr<IoLoop::Watch> exitWatch;
   std::unique_ptr<IoLoop::Watch> outputWatch;
+  std::unique_ptr<IoLoop::Watch> heldWatch;
   std::optional<SXError> cause;
   {
     const std::lock_guard lock(mutex_);
@@ -300,13 +302,17 @@ bool ExtensionProcess::reapIfExited() {
     siginfo_t information{};
     const int waited = ::waitid(P_PIDFD, static_cast<id_t>(pidfd_.get()), &information, WEXITED | WNOHANG);
     if (waited != 0 && errno == EINTR) return false;
-    if (waited == 0 && information.si_pid == 0) return false;
+    if (waited == 0 && information.si_pid == 0) {
+      if (exitWatch_) reapLater();
+      return false;
+    }
     isGone_ = true;
     // Where somebody else has reaped it there is nothing more to know than that it is gone.
     cause = exitCause(waited == 0 ? information.si_code : CLD_EXITED, waited == 0 ? information.si_status : 0);
     state_ = State::ending;
     exitWatch = std::move(exitWatch_);
     outputWatch = std::move(outputWatch_);
+    heldWatch = std::move(heldWatch_);
     // Where somebody who waits for the exit has taken the watch, it is still at it: then the descriptor stays as
     // long as this object.
     if (exitWatch) pidfd = std::move(pidfd_);
@@ -318,6 +324,7 @@ bool ExtensionProcess::reapIfExited() {
   }
   exitWatch.reset();
   outputWatch.reset();
+  heldWatch.reset();
   takeOutput(outputAfterExit);
   {
     const std::lock_guard lock(outputMutex_);
@@ -328,6 +335,23 @@ bool ExtensionProcess::reapIfExited() {
   settle(*cause, true);
   if (handlers_.gone) handlers_.gone(shared_from_this());
   return true;
+}
+
+/// With the mutex held. The descriptor of a process that a debugger holds tells of the exit all the time, which
+/// would keep a thread of the loop busy until the debugger lets go.
+void ExtensionProcess::reapLater() {
+  if (!heldWatch_) {
+    heldTimer_.reset(::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK));
+    if (!heldTimer_) return;
+    heldWatch_ = surroundings_.loop.watch(heldTimer_.get(), EPOLLIN, [weak = weak_from_this()](std::uint32_t) {
+      if (const auto self = weak.lock()) self->reapIfExited();
+    });
+    if (!heldWatch_) return;
+  }
+  itimerspec next{};
+  next.it_value.tv_nsec = std::chrono::nanoseconds(timeUntilReaped).count();
+  // The timer is not readable again before then.
+  if (::timerfd_settime(heldTimer_.get(), 0, &next, nullptr) == 0) exitWatch_->setEvents(0);
 }
 
 SXError ExtensionProcess::exitCause(int code, int status) const {
@@ -401,12 +425,15 @@ void ExtensionProcess::endNow(int signal) {
 
 bool ExtensionProcess::waitForExit(std::chrono::milliseconds time) {
   std::unique_ptr<IoLoop::Watch> exitWatch;
+  std::unique_ptr<IoLoop::Watch> heldWatch;
   {
     const std::lock_guard lock(mutex_);
     exitWatch = std::move(exitWatch_);
+    heldWatch = std::move(heldWatch_);
   }
   // From here on no other thread reaps it, so that the descriptor stays.
   exitWatch.reset();
+  heldWatch.reset();
   const auto deadline = std::chrono::steady_clock::now() + time;
   for (;;) {
     pollfd waiting{};

@@ -35,7 +35,7 @@ class ExtensionProcess : public std::enable_shared_from_this<ExtensionProcess> {
   static constexpr std::chrono::seconds timeUntilSignal{5};
   /// How long after the end of its connection the reason, an exit most often, is waited for.
   static constexpr std::chrono::seconds timeUntilExit{1};
-  /// At the daemon's end: how often it is tried to reap one that has exited, but that a debugger holds.
+  /// How often it is tried to reap a process that has exited, but that a debugger holds.
   static constexpr std::chrono::milliseconds timeUntilReaped{10};
   /// Messages that it has not answered yet. Sixteen clients with all that they may have in flight; and as
   /// requests that want no answer count nowhere else, what a process that hangs can cost the daemon.
@@ -102,6 +102,7 @@ class ExtensionProcess : public std::enable_shared_from_this<ExtensionProcess> {
   void takeOutput(std::size_t limit);
   /// Whether it is gone. A debugger can hold it for a while after its exit.
   bool reapIfExited();
+  void reapLater();
   [[nodiscard]] SXError exitCause(int code, int status) const;
   void closeConnectionAndEscalate();
   void sendSignal(int signal);
@@ -128,6 +129,9 @@ class ExtensionProcess : public std::enable_shared_from_this<ExtensionProcess> {
   std::unique_ptr<IoLoop::Watch> connectionWatch_;
   std::unique_ptr<IoLoop::Watch> exitWatch_;
   std::unique_ptr<IoLoop::Watch> outputWatch_;
+  /// Where a debugger holds it.
+  UniqueFd heldTimer_;
+  std::unique_ptr<IoLoop::Watch> heldWatch_;
 
   std::mutex outputMutex_;
   UniqueFd output_;

@@ -159,6 +159,7 @@ std::string tracerText() {
     ::alarm(60);  // should the test end before it has killed this process
     const int failure = ::ptrace(PTRACE_SEIZE, traced, nullptr, nullptr) == 0 ? 0 : errno;
     static_cast<void>(!::write(ready[1], &failure, sizeof(failure)));
+    if (failure != 0) ::_exit(1);
     for (int fd = 0; fd < 100; ++fd) ::close(fd);
     for (;;) {
       // A signal for the traced one stops it here, and goes on to it. Its end is left unheard.
