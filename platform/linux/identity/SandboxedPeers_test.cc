@@ -3,10 +3,13 @@
 #include <gmock/gmock.h>
 #include <spawn.h>
 
+#include <cerrno>
 #include <filesystem>
+#include <utility>
 #include <variant>
 #include <vector>
 
+#include "platform/linux/TestDescriptors.h"
 #include "platform/linux/TestDirectory.h"
 #include "platform/linux/identity/ApplicationManifests.h"
 #include "platform/linux/identity/Sandbox.h"
@@ -46,18 +49,10 @@ class StartedPeer {
   [[nodiscard]] std::variant<UniqueFd, int> open(const std::string &path, int flags) const {
     const std::string text = std::to_string(flags) + " " + path;
     if (::send(control_.get(), text.data(), text.size(), MSG_NOSIGNAL) < 0) return errno;
-    unsigned char error = 255;
-    iovec content{&error, 1};
-    alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int))> buffer{};
-    msghdr message{};
-    message.msg_iov = &content;
-    message.msg_iovlen = 1;
-    message.msg_control = buffer.data();
-    message.msg_controllen = buffer.size();
-    if (::recvmsg(control_.get(), &message, MSG_CMSG_CLOEXEC) != 1 || error != 0) return int{error};
-    int fd = -1;
-    std::memcpy(&fd, CMSG_DATA(CMSG_FIRSTHDR(&message)), sizeof fd);
-    return UniqueFd(fd);
+    ReceivedByte error = receiveByte(control_.get());
+    if (!error.isThere) return EIO;
+    if (error.value != 0) return int{error.value};
+    return std::move(error.descriptor);
   }
 
   void end() {

@@ -10,7 +10,9 @@
 #include <array>
 #include <csignal>
 #include <cstring>
+#include <utility>
 
+#include "platform/linux/TestDescriptors.h"
 #include "platform/linux/TestDirectory.h"
 #include "platform/linux/TestLog.h"
 #include "platform/linux/identity/ApplicationManifests.h"
@@ -231,20 +233,10 @@ TEST_F(PlatformSocketTest, ConfinedProcessPostsNothing) {
   theirs.reset();
   pollfd handed{ours.get(), POLLIN, 0};
   ASSERT_EQ(::poll(&handed, 1, 60'000), 1);
-  char byte = 0;
-  iovec content{&byte, 1};
-  alignas(cmsghdr) std::array<char, CMSG_SPACE(sizeof(int))> control{};
-  msghdr message{};
-  message.msg_iov = &content;
-  message.msg_iovlen = 1;
-  message.msg_control = control.data();
-  message.msg_controllen = control.size();
-  ASSERT_EQ(::recvmsg(ours.get(), &message, MSG_CMSG_CLOEXEC), 1);
-  ASSERT_NE(CMSG_FIRSTHDR(&message), nullptr);
-  int number = -1;
-  std::memcpy(&number, CMSG_DATA(CMSG_FIRSTHDR(&message)), sizeof number);
+  ReceivedByte received = receiveByte(ours.get());
+  ASSERT_TRUE(received.isThere && received.descriptor);
 
-  PlatformClient client(pool_, UniqueFd(number));
+  PlatformClient client(pool_, std::move(received.descriptor));
   EXPECT_EQ(
       client.errorOf(wire::notificationsInterface(), wire::postMethod, valuesOf(std::string("org.sample.wanted"))),
       wire::busErrorName::accessDenied);
